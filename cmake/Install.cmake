@@ -1,0 +1,38 @@
+# `cmake --install`: the library, the tool, the headers, a CMake package and a pkg-config file.
+
+include(CMakePackageConfigHelpers)
+
+set(KORVEL_HEADER_DIR ${CMAKE_INSTALL_INCLUDEDIR}/korvelscript)
+set(KORVEL_PACKAGE_DIR ${CMAKE_INSTALL_LIBDIR}/cmake/korvelscript)
+
+install(TARGETS korvelscript EXPORT korvelscriptTargets
+    LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR}
+    INCLUDES DESTINATION ${KORVEL_HEADER_DIR}
+)
+install(TARGETS oxscript RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
+foreach(header IN LISTS KORVEL_PUBLIC_HEADERS)
+    cmake_path(GET header PARENT_PATH folder)
+    install(FILES src/${header} DESTINATION ${KORVEL_HEADER_DIR}/${folder})
+endforeach()
+
+install(EXPORT korvelscriptTargets DESTINATION ${KORVEL_PACKAGE_DIR})
+configure_package_config_file(cmake/korvelscriptConfig.cmake.in
+    ${CMAKE_CURRENT_BINARY_DIR}/korvelscriptConfig.cmake
+    INSTALL_DESTINATION ${KORVEL_PACKAGE_DIR}
+)
+write_basic_package_version_file(${CMAKE_CURRENT_BINARY_DIR}/korvelscriptConfigVersion.cmake
+    COMPATIBILITY SameMajorVersion
+)
+install(FILES
+    ${CMAKE_CURRENT_BINARY_DIR}/korvelscriptConfig.cmake
+    ${CMAKE_CURRENT_BINARY_DIR}/korvelscriptConfigVersion.cmake
+    DESTINATION ${KORVEL_PACKAGE_DIR}
+)
+# The prefix is filled in when the tree is installed, so that --prefix holds for pkg-config, too.
+# Relative to the file itself, so that `--prefix` and a moved tree hold for pkg-config, too.
+file(RELATIVE_PATH KORVEL_PC_TO_PREFIX /prefix/${CMAKE_INSTALL_LIBDIR}/pkgconfig /prefix)
+configure_file(cmake/korvelscript.pc.in ${CMAKE_CURRENT_BINARY_DIR}/korvelscript.pc @ONLY)
+install(FILES ${CMAKE_CURRENT_BINARY_DIR}/korvelscript.pc
+    DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig
+)
+install(FILES LICENSE README.md DESTINATION ${CMAKE_INSTALL_DOCDIR})

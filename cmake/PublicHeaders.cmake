@@ -1,0 +1,23 @@
+# The headers that are installed, relative to src/. A test compiles each of them alone.
+set(KORVEL_PUBLIC_HEADERS
+    Platform/Event.h
+    Platform/EventQueue.h
+    Platform/Events.h
+    Platform/Lock.h
+    Platform/MinList.h
+    Platform/Mutex.h
+    Platform/Platform.h
+    Platform/Processes.h
+    Platform/Strings.h
+    Platform/Threads.h
+    Platform/Time.h
+    core/0ReusePool.h
+    core/Annotations.h
+    core/Export.h
+    core/OxID.h
+    core/OxString.h
+    core/TextCell.h
+    diag/Env.h
+    runtime/lua/KRScriptLib.h
+    runtime/lua/RunScript.h
+)

@@ -1,0 +1,20 @@
+#include "Platform/Lock.h"
+
+#include "Platform/Events.h"
+#include "Platform/Mutex.h"
+
+namespace Korvel::KorvelScript {
+
+Lock::Lock() : m_Mutex(Platform::NewMutex(false)) {}
+Lock::~Lock() {
+    Platform::DeleteMutex(m_Mutex);
+}
+
+bool Lock::ObtainLock() {
+    return Platform::ObtainMutex(m_Mutex, Platform::kNoTimeLimit);
+}
+void Lock::ReleaseLock() {
+    Platform::ReleaseMutex(m_Mutex);
+}
+
+}  // namespace Korvel::KorvelScript

@@ -1,0 +1,79 @@
+#pragma once
+
+#include <pthread.h>
+
+#include <atomic>
+#include <cstdint>
+#include <mutex>
+
+#include "Platform/Events.h"
+#include "Platform/FutexInternal.h"
+#include "Platform/NoKillInternal.h"
+#include "Platform/Threads.h"
+#include "core/0ReusePool.h"
+
+namespace Korvel {
+struct Magazine;
+}
+
+namespace Korvel::Platform {
+
+enum class ThreadKind : uint8_t {
+    Bare,     // no thread behind it: a record of CreateThreadStruct alone
+    Made,     // by NewThread
+    Adopted,  // somebody else's thread; it can neither be killed nor detached
+};
+
+// Who ends a body, and with that who drops the body's reference.
+enum class ThreadFate : uint8_t {
+    Running,
+    KillAsked,  // KillThread is signalling; the handler may end the thread
+    Killed,     // by the handler: the reference is for KillThread to drop, after its join
+    Ended,      // the reference is spoken for: dropped, or about to be, by whoever wrote this
+};
+
+struct _Thread : Reuser {
+    std::atomic<uint32_t> m_RefCount{1};
+    pthread_t m_OSThread{};
+    unsigned long long m_ID = 0;
+    _Event* m_QuitEvent = nullptr;
+    ThreadEntry m_Entry = nullptr;
+    void* m_Argument = nullptr;
+
+    // Fixed before the gate has left its first state
+    ThreadKind m_Kind = ThreadKind::Bare;
+    Magazine* m_Magazine = nullptr;  // what a killed thread cannot give back itself
+
+    FutexWord m_Gate{0};
+    std::atomic<ThreadFate> m_Fate{ThreadFate::Running};
+
+    // The futex word that the thread sleeps on where a kill may end it; else null.
+    std::atomic<const void*> m_SleepsOn{nullptr};
+
+    // Held, under NoKill, by whoever joins the thread or uses m_OSThread: after the join there must
+    // be no call on that handle any more.
+    std::mutex m_JoinMutex;
+    std::atomic<bool> m_IsJoined{false};  // written under m_JoinMutex
+};
+
+// The calling thread's record; null as long as a thread that is not ours has not been adopted.
+extern constinit thread_local _Thread* t_ThisThread __attribute__((tls_model("initial-exec")));
+
+// Lets the current thread be killed while it sleeps on a futex word, inside of its caller's one
+// NoKill guard. Whoever kills it wakes another sleeper of that word in its place: the dead thread
+// may have been chosen for a wake-up that it did not live to act on.
+class KillableSleep {
+public:
+    explicit KillableSleep(const void* word) {
+        if (t_ThisThread) t_ThisThread->m_SleepsOn.store(word, std::memory_order_relaxed);
+        AddNoKillDepth(-1);
+    }
+    KillableSleep(const KillableSleep&) = delete;
+    KillableSleep& operator=(const KillableSleep&) = delete;
+    ~KillableSleep() {
+        AddNoKillDepth(1);
+        if (t_ThisThread) t_ThisThread->m_SleepsOn.store(nullptr, std::memory_order_relaxed);
+    }
+};
+
+}  // namespace Korvel::Platform

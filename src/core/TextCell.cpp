@@ -1,0 +1,54 @@
+#include "core/TextCell.h"
+
+#include <cassert>
+#include <climits>
+#include <cstring>
+
+#include "core/0ReusePool.h"
+
+namespace Korvel::TextCell {
+namespace {
+
+// count, marker and terminator
+constexpr unsigned long kOverhead = sizeof(uint32_t) + 2;
+
+// Debug builds sign the unused header word of a cell's block, so that Check can tell a cell from a
+// foreign text that merely begins with the marker.
+constexpr uint64_t kSignature = 0x6C6C65436F725478;
+
+uint64_t& UnusedHeaderWord(const char* cell) {
+    char* block = const_cast<char*>(cell) - sizeof(uint32_t);
+    return reinterpret_cast<uint64_t*>(block)[-1];
+}
+
+}  // namespace
+
+char* New(unsigned long length) {
+    if (length > INT_MAX - kOverhead) return nullptr;
+    char* block = static_cast<char*>(g_ReusePoolMgr.Alloc(length + kOverhead));
+    if (!block) return nullptr;
+    char* cell = block + sizeof(uint32_t);
+    new (block) std::atomic<uint32_t>(1);
+    cell[0] = kMarker;
+    cell[length + 1] = '\0';
+#ifndef NDEBUG
+    UnusedHeaderWord(cell) = kSignature;
+#endif
+    return cell;
+}
+
+#ifndef NDEBUG
+void Check(const char* cell) {
+    assert(UnusedHeaderWord(cell) == kSignature && "a plain text begins with byte 0xFF");
+}
+#endif
+
+void Free(const char* cell) {
+#ifndef NDEBUG
+    Check(cell);
+    UnusedHeaderWord(cell) = 0;
+#endif
+    g_ReusePoolMgr.Free(const_cast<char*>(cell) - sizeof(uint32_t));
+}
+
+}  // namespace Korvel::TextCell

@@ -1,0 +1,139 @@
+// What scripts find in `orv`. This source is reached by `require "krscript"` from plain Lua 5.1,
+// where an error is a longjmp: no function here holds an object with a destructor across a call
+// that can raise one.
+#include "runtime/lua/KRScriptLib.h"
+
+#include <unistd.h>
+
+#include <cstring>
+#include <lua.hpp>
+
+#include "Platform/Time.h"
+
+extern "C" int luaopen_lpeg(lua_State* L);
+
+namespace Korvel {
+namespace {
+
+constexpr char kVersion[] = "18.0";
+
+// The longest wait that a number of milliseconds can ask for.
+constexpr double kMaxWaitMs = 4294967295.0;
+
+// The host library's functions are named as scripts call them.
+
+int getpid(lua_State* L) {
+    lua_pushnumber(L, ::getpid());
+    return 1;
+}
+
+// Sleeps. The duration is in seconds; nothing but a number above 0 sleeps.
+int wait(lua_State* L) {
+    double ms = lua_tonumber(L, 1) * 1000;
+    if (ms > 0) Platform::Wait(static_cast<unsigned long long>(ms < kMaxWaitMs ? ms : kMaxWaitMs));
+    return 0;
+}
+
+int getuptime(lua_State* L) {
+    lua_pushnumber(L, static_cast<double>(Platform::GetUpTime()) / 1000);
+    return 1;
+}
+
+int gettime(lua_State* L) {
+    lua_pushnumber(L, static_cast<double>(Platform::GetTimeCount()) /
+                          static_cast<double>(Platform::GetTimeFreq()));
+    return 1;
+}
+
+// os.exit: leaves the code and the data in two globals and ends the script with an empty error. The
+// process is the host's to end.
+int myexit(lua_State* L) {
+    lua_settop(L, 2);
+    if (lua_type(L, 2) != LUA_TTABLE) {
+        lua_pushnil(L);
+        lua_replace(L, 2);
+    }
+    lua_setglobal(L, "_EXITDATA");
+    lua_pushnumber(L, lua_type(L, 1) == LUA_TNUMBER ? lua_tonumber(L, 1) : 0);
+    lua_setglobal(L, "_EXITCODE");
+    lua_settop(L, 0);
+    lua_pushliteral(L, "");
+    return lua_error(L);
+}
+
+constexpr luaL_Reg kFunctions[] = {
+    {"getpid", getpid},   {"wait", wait},   {"getuptime", getuptime},
+    {"gettime", gettime}, {"exit", myexit}, {nullptr, nullptr},
+};
+
+// Opens the library under its second name: a table of its own with the same functions, so that a
+// script that adds to one does not change the other.
+void OpenCopy(lua_State* L, const char* name, int original) {
+    constexpr luaL_Reg kNothing[] = {{nullptr, nullptr}};
+    luaL_register(L, name, kNothing);
+    for (lua_pushnil(L); lua_next(L, original) != 0;) {
+        lua_pushvalue(L, -2);
+        lua_insert(L, -2);
+        lua_rawset(L, -4);
+    }
+}
+
+}  // namespace
+
+void require(lua_State* L, const char* name, bool setGlobal) {
+    lua_getglobal(L, "require");
+    lua_pushstring(L, name);
+    if (lua_pcall(L, 1, 1, 0) == 0 && setGlobal) {
+        lua_setglobal(L, name);
+    } else {
+        lua_pop(L, 1);
+    }
+}
+
+void OpenAllLibs(lua_State* L, TagList*) {
+    luaL_openlibs(L);
+    lua_getglobal(L, "package");
+    lua_getfield(L, -1, "preload");
+    lua_pushcfunction(L, luaopen_lpeg);
+    lua_setfield(L, -2, "lpeg");
+    require(L, "lpeg", true);
+    luaopen_krscript(L);
+    lua_settop(L, 0);
+}
+
+void CloseAllLibs(lua_State*, TagList*) {}
+
+void SetArgs(lua_State* L, char** argv, int first) {
+    lua_newtable(L);
+    int next = first;
+    for (; argv && *argv; argv++) {
+        if (const char* sign = strchr(*argv, '=')) {
+            lua_pushlstring(L, *argv, static_cast<size_t>(sign - *argv));
+            lua_pushstring(L, sign + 1);
+            lua_rawset(L, -3);
+        } else {
+            lua_pushstring(L, *argv);
+            lua_rawseti(L, -2, next++);
+        }
+    }
+    lua_pushnumber(L, next - 1);
+    lua_setfield(L, -2, "n");
+    lua_setglobal(L, "arg");
+}
+
+}  // namespace Korvel
+
+extern "C" int luaopen_krscript(lua_State* L) {
+    luaL_register(L, "orv", Korvel::kFunctions);
+    int orv = lua_gettop(L);
+    lua_pushstring(L, Korvel::kVersion);
+    lua_setfield(L, orv, "_VERSION");
+    Korvel::OpenCopy(L, "ondry", orv);
+    lua_getglobal(L, "os");
+    if (lua_istable(L, -1)) {
+        lua_getfield(L, orv, "exit");
+        lua_setfield(L, -2, "exit");
+    }
+    lua_settop(L, orv);
+    return 1;
+}

@@ -1,0 +1,191 @@
+#include "core/OxID.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "core/FaultsInternal.h"
+#include "core/TextCell.h"
+
+namespace Korvel {
+namespace {
+
+const char* Raw(const OxID& id) {
+    return *reinterpret_cast<const char* const*>(&id);
+}
+
+TEST(GetHashValue, MatchesTheKnownValues) {
+    struct Case {
+        const char* text;
+        uint32_t hash;
+    };
+    const Case cases[] = {{"", 0},
+                          {"a", 97},
+                          {"A", 97},
+                          {"ab", 0xFFFCF7FF},
+                          {"AB", 0xFFFCF7FF},
+                          {"Error", 0xE1A61F17},
+                          {"error", 0xE1A61F17},
+                          {"\x80", 0xFFFFFF80}};
+    for (const Case& c : cases) EXPECT_EQ(GetHashValue(c.text), c.hash) << c.text;
+    EXPECT_EQ(GetHashValue(nullptr), 0u);
+    EXPECT_EQ(GetHashValue("abc", -1), 0u);
+    EXPECT_EQ(GetHashValue("Abc", 2), 0xFFFCF7FFu);
+    EXPECT_NE(GetHashValue("a\0b", 3), GetHashValue("a"));  // a NUL is a byte like any other
+    EXPECT_NE(GetHashValue("\xC3\x84"), GetHashValue("\xC3\xA4"));
+    EXPECT_EQ(OxID("Error").GetHashValue(), 0xE1A61F17u);
+}
+
+TEST(OxID, BorrowsSharesAndCopies) {
+    const char text[] = "Name";
+    OxID borrowed(text);
+    EXPECT_EQ(Raw(borrowed), text);
+
+    OxID copied(text, true);
+    EXPECT_NE(Raw(copied), text);
+    EXPECT_TRUE(TextCell::IsCell(Raw(copied)));
+    {
+        OxID shared(copied), sharedAsText(Raw(copied), true), whole(copied.Mid(0, 4));
+        EXPECT_EQ(Raw(shared), Raw(copied));
+        EXPECT_EQ(Raw(sharedAsText), Raw(copied));
+        EXPECT_EQ(Raw(whole), Raw(copied));
+        EXPECT_EQ(TextCell::Count(Raw(copied)), 4u);
+    }
+    EXPECT_EQ(TextCell::Count(Raw(copied)), 1u);
+
+    OxID moved(std::move(copied));
+    EXPECT_FALSE(copied.IsValid());  // NOLINT(bugprone-use-after-move): the rule under test
+    EXPECT_STREQ(moved, "Name");
+
+    OxID prefix("Name.Group", 4ul);
+    EXPECT_STREQ(prefix, "Name");
+    EXPECT_STREQ(OxID("ab", 10ul), "ab");
+    EXPECT_STREQ(OxID(nullptr, "b"), "b");
+    EXPECT_STREQ(OxID("a", static_cast<const char*>(nullptr)), "a");
+    EXPECT_STREQ(OxID(prefix, Raw(prefix)), "NameName");  // skips the marker of a cell
+    EXPECT_FALSE(OxID(nullptr, true).IsValid());
+}
+
+TEST(OxID, EqualityTreatsNullAsEmpty) {
+    EXPECT_TRUE(NOID == "");
+    EXPECT_TRUE(NOID == nullptr);
+    EXPECT_TRUE(OxID("") == NOID);
+    EXPECT_TRUE(OxID("a", true) == OxID("a"));
+    EXPECT_TRUE(OxID("a") != "A");
+    EXPECT_TRUE(OxID("a") != nullptr);
+    EXPECT_TRUE(OxID("").IsValid());
+    EXPECT_TRUE(OxID("").IsEmpty());
+    EXPECT_FALSE(NOID.IsValid());
+    const OxID* volatile none = nullptr;  // volatile, or the compiler sees through the call
+    EXPECT_FALSE(none->IsValid());
+    EXPECT_TRUE(none->IsEmpty());
+    EXPECT_EQ(none->GetLength(), 0);
+}
+
+TEST(OxID, FindsAndCuts) {
+    OxID id("a.b.c");
+    EXPECT_EQ(id.Find('.'), 1);
+    EXPECT_EQ(id.Find('.', 2), 3);
+    EXPECT_EQ(id.Find('.', 5), -1);
+    EXPECT_EQ(id.Find('.', -1), -1);
+    EXPECT_EQ(id.Find('\0'), -1);
+    EXPECT_EQ(id.ReverseFind('.'), 3);
+    EXPECT_EQ(id.ReverseFind('.', 2), 1);
+    EXPECT_EQ(id.ReverseFind('a', 5), -1);
+    EXPECT_EQ(id.ReverseFind('x'), -1);
+    EXPECT_EQ(NOID.ReverseFind('x'), -1);
+    EXPECT_STREQ(id.Mid(2, 1), "b");
+    EXPECT_STREQ(id.Mid(2), "b.c");
+    EXPECT_STREQ(id.Mid(2, 100), "b.c");
+    EXPECT_STREQ(id.Mid(-3, 2), "a.");
+    EXPECT_STREQ(id.Left(3), "a.b");
+    EXPECT_FALSE(id.Mid(5).IsValid());
+}
+
+TEST(OxID, ComparesBeginningsEndsAndGroups) {
+    OxID id("Net.Host");
+    EXPECT_TRUE(id.BeginsWith("Net") && id.EndsWith("Host") && id.BeginsWith(nullptr));
+    EXPECT_FALSE(id.BeginsWith("net") || id.EndsWith("host") || id.EndsWith("xxxNet.Host"));
+    EXPECT_TRUE(id.BeginsWithNoCase("nET") && id.EndsWithNoCase("HOST"));
+    EXPECT_TRUE(NOID.BeginsWith("") && NOID.EndsWith(nullptr) && !NOID.BeginsWith("a"));
+
+    EXPECT_TRUE(id.IsInGroup() && !OxID("Host").IsInGroup());
+    EXPECT_TRUE(id.IsInGroup("Net") && id.IsInGroup("Net.") && id.IsInGroup("Net.Host"));
+    EXPECT_FALSE(id.IsInGroup("Ne") || id.IsInGroup("net") || id.IsInGroup(nullptr));
+    EXPECT_TRUE(id.IsSameGroup("Net.Port") && OxID("a").IsSameGroup("b"));
+    EXPECT_FALSE(id.IsSameGroup("Net") || id.IsSameGroup("Nut.Host") || id.IsSameGroup("N.Host"));
+
+    for (const char* good : {"a", "_", "a9_", "a.b", "a._9"})
+        EXPECT_TRUE(OxID(good).IsValidSymbol());
+    for (const char* bad : {"", "9a", ".a", "a.", "a..b", "a.9", "a b", "\xC3\xA4"}) {
+        EXPECT_FALSE(OxID(bad).IsValidSymbol()) << bad;
+    }
+    EXPECT_FALSE(NOID.IsValidSymbol());
+}
+
+TEST(OxID, EditsItselfOutOfItsOwnText) {
+    OxID id("ab", true);
+    id += id;
+    EXPECT_STREQ(id, "abab");
+    id.CatF("-%s", static_cast<const char*>(id));
+    EXPECT_STREQ(id, "abab-abab");
+    id.PrintF("<%s>", static_cast<const char*>(id));
+    EXPECT_STREQ(id, "<abab-abab>");
+    id.Set(id, 3ul);
+    EXPECT_STREQ(id, "<ab");
+    id = id;  // NOLINT: the rule under test
+    id += '!';
+    id += nullptr;
+    EXPECT_STREQ("(" + id + ")", "(<ab!)");
+    id.PrintF("%0*d", 10000, 1);
+    EXPECT_EQ(id.GetLength(), 10000);
+}
+
+TEST(OxID, HoldersOnManyThreadsShareACell) {
+    OxID id("shared", true);
+    std::vector<std::thread> threads;
+    for (int i = 0; i < 4; i++) {
+        threads.emplace_back([id] {
+            for (int k = 0; k < 5000; k++) {
+                OxID copy(id);
+                OxID other;
+                other = copy;
+            }
+        });
+    }
+    for (std::thread& thread : threads) thread.join();
+    threads.clear();
+    EXPECT_EQ(TextCell::Count(Raw(id)), 1u);
+}
+
+#ifdef KORVEL_FAULTS
+TEST(OxID, BecomesNullWhereMemoryRunsOut) {
+    for (unsigned n = 1; n <= 5; n++) {
+        Faults::FailAt(n, true);
+        OxID id("text", true);
+        id += "more";
+        OxID sum = id + "x";
+        sum.PrintF("%s", "formatted");
+        OxID cut = sum.Left(2);
+        Faults::Stop();
+        EXPECT_TRUE(n > 1 || !id.IsValid());
+        EXPECT_TRUE(n > 4 || !sum.IsValid());
+    }
+}
+#endif
+
+#if !defined(NDEBUG) && !defined(__SANITIZE_THREAD__)
+TEST(OxIDDeathTest, AForeignTextWithTheMarkerIsCaught) {
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    alignas(16) char memory[64] = {};
+    memory[40] = TextCell::kMarker;
+    EXPECT_DEATH(OxID(memory + 40, true), "0xFF");
+    EXPECT_EQ(TextCell::SafeFirstByte('\xFF'), '?');
+    EXPECT_EQ(TextCell::SafeFirstByte('\xFE'), '\xFE');
+}
+#endif
+
+}  // namespace
+}  // namespace Korvel

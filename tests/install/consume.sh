@@ -1,0 +1,38 @@
+#!/bin/sh
+# consume.sh CMAKE BUILD SOURCE COMPILER FLAGS: installs a build into a place of its own and builds
+# and runs a consumer against it, once through the CMake package and once through pkg-config.
+set -eu
+cmake=$1 build=$2 source=$3 compiler=$4 flags=$5
+place=$(mktemp -d)
+trap 'rm -rf "$place"' EXIT
+
+# quietly COMMAND...: shows what the command prints only when it fails.
+quietly() { "$@" >"$place/log" 2>&1 || { cat "$place/log"; exit 1; }; }
+
+quietly "$cmake" --install "$build" --prefix "$place/installed"
+printf 'assert(arg[1] == "word" and orv.getpid() > 0)\nreturn 7\n' >"$place/script.lua"
+
+check() {
+    [ "$("$1" | cut -d' ' -f1)" = 'consumer!' ] || { echo "$1 printed something else"; exit 1; }
+    status=0
+    "$1" "$place/script.lua" word || status=$?
+    [ $status = 7 ] || { echo "$1 ended with $status"; exit 1; }
+}
+
+quietly "$cmake" -S "$source" -B "$place/build" -G Ninja -DCMAKE_PREFIX_PATH="$place/installed" \
+    -DCMAKE_CXX_COMPILER="$compiler" -DCMAKE_CXX_FLAGS="$flags"
+quietly "$cmake" --build "$place/build"
+check "$place/build/consumer"
+
+libdir=$(dirname "$(find "$place/installed" -name korvelscript.pc)")
+PKG_CONFIG_PATH=$libdir
+export PKG_CONFIG_PATH
+# shellcheck disable=SC2046,SC2086
+"$compiler" -std=c++20 $flags "$source/consumer.cpp" -o "$place/consumer" \
+    $(pkg-config --cflags --libs korvelscript)
+LD_LIBRARY_PATH=$(pkg-config --variable=libdir korvelscript)
+export LD_LIBRARY_PATH
+check "$place/consumer"
+
+unset LD_LIBRARY_PATH
+"$place/installed/bin/oxscript" --version

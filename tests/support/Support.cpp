@@ -1,0 +1,73 @@
+#include "Support.h"
+
+#include <fcntl.h>
+#include <spawn.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <stdexcept>
+
+namespace Korvel::Test {
+namespace {
+
+std::string ReadFile(const std::string& path) {
+    std::ifstream file(path, std::ios::binary);
+    std::stringstream content;
+    content << file.rdbuf();
+    return content.str();
+}
+
+std::vector<char*> Pointers(const std::vector<std::string>& texts) {
+    std::vector<char*> pointers;
+    for (const std::string& text : texts) pointers.push_back(const_cast<char*>(text.c_str()));
+    pointers.push_back(nullptr);
+    return pointers;
+}
+
+}  // namespace
+
+TempDir::TempDir() {
+    std::string path = std::filesystem::temp_directory_path() / "korvelscript-XXXXXX";
+    if (!mkdtemp(path.data())) throw std::runtime_error("no temporary directory");
+    m_Path = path;
+}
+
+TempDir::~TempDir() {
+    std::error_code ignored;
+    std::filesystem::remove_all(m_Path, ignored);
+}
+
+std::string TempDir::Write(const std::string& name, const std::string& content) const {
+    std::ofstream(Path(name), std::ios::binary) << content;
+    return Path(name);
+}
+
+ProcessResult RunProcess(const std::vector<std::string>& argv,
+                         const std::vector<std::string>& settings) {
+    TempDir dir;
+    std::vector<std::string> environment = settings;
+    for (char** entry = environ; *entry; entry++) environment.push_back(*entry);
+
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    const int flags = O_WRONLY | O_CREAT;
+    posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
+    posix_spawn_file_actions_addopen(&actions, 1, dir.Path("out").c_str(), flags, 0600);
+    posix_spawn_file_actions_addopen(&actions, 2, dir.Path("err").c_str(), flags, 0600);
+    pid_t pid = 0;
+    int error = posix_spawnp(&pid, argv[0].c_str(), &actions, nullptr, Pointers(argv).data(),
+                             Pointers(environment).data());
+    posix_spawn_file_actions_destroy(&actions);
+    if (error != 0) throw std::runtime_error("cannot start " + argv[0]);
+
+    int status = 0;
+    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) continue;
+    return {WIFEXITED(status) ? WEXITSTATUS(status) : -1 - WTERMSIG(status),
+            ReadFile(dir.Path("out")), ReadFile(dir.Path("err"))};
+}
+
+}  // namespace Korvel::Test

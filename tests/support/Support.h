@@ -1,0 +1,37 @@
+#pragma once
+
+#include <string>
+#include <vector>
+
+namespace Korvel::Test {
+
+// A directory of the test's own, removed with all that is in it.
+class TempDir {
+public:
+    TempDir();
+    TempDir(const TempDir&) = delete;
+    TempDir& operator=(const TempDir&) = delete;
+    ~TempDir();
+
+    std::string Path(const std::string& name) const { return m_Path + "/" + name; }
+
+    // Writes a file and returns its path.
+    std::string Write(const std::string& name, const std::string& content) const;
+
+private:
+    std::string m_Path;
+};
+
+// What a finished process has left behind.
+struct ProcessResult {
+    int m_Status;  // exit status, or -1 - signal when a signal ended it
+    std::string m_Out;
+    std::string m_Err;
+};
+
+// Runs a program with its arguments and waits for its end. `settings` ("NAME=value") are added to
+// its environment.
+ProcessResult RunProcess(const std::vector<std::string>& argv,
+                         const std::vector<std::string>& settings = {});
+
+}  // namespace Korvel::Test
