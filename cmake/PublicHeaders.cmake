@@ -16,7 +16,7 @@ set(KORVEL_PUBLIC_HEADERS
     core/Export.h
     core/OxID.h
     core/OxString.h
-    core/TextCell.h
+    core/SpinLock.h
     diag/Env.h
     runtime/lua/KRScriptLib.h
     runtime/lua/RunScript.h

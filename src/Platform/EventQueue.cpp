@@ -1,5 +1,7 @@
 #include "Platform/EventQueue.h"
 
+#include "Platform/EventsInternal.h"
+#include "Platform/FutexInternal.h"
 #include "Platform/NoKillInternal.h"
 
 namespace Korvel::KorvelScript {
@@ -11,9 +13,14 @@ void QueueNode::Reply() {
 void EventQueue::Put(QueueNode* node) {
     if (!node) return;
     Platform::NoKill noKill;
-    AutoLock guard(*this);
-    Add(node);
-    Signal();
+    const void* sleeper;
+    {
+        AutoLock guard(*this);
+        Add(node);
+        sleeper = Platform::SetEventQuietly(GetEvent());
+    }
+    // From here on the taker may have deleted the queue.
+    if (sleeper) Platform::FutexWake(sleeper, 1);
 }
 
 QueueNode* EventQueue::Get() {

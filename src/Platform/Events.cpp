@@ -1,26 +1,29 @@
-// Events on a mutex and a futex word.
+// Events on a lock and a futex word.
 //
 // The C library's condition variables keep books on their waiters in user space, which a waiter
 // that is killed leaves wrong: others then lose wake-ups and the destruction waits for ever. Here
 // the system's queue is the only book, and a killed thread leaves that by itself.
+//
+// Waiters sleep on m_Sequence. Whoever sets the event has the lock, and a waiter that ran at that
+// moment would only bump into it and sleep again. So the signal moves the waiter over to the lock's
+// queue, and it runs when the lock is let go.
 #include "Platform/Events.h"
 
 #include <climits>
-#include <mutex>
 
+#include "Platform/EventsInternal.h"
 #include "Platform/ThreadInternal.h"
 
 namespace Korvel::Platform {
 
 struct _Event : Reuser {
-    std::mutex m_Mutex;  // only held under NoKill, and never for long
+    FutexLock m_Lock;
 
-    // Waiters sleep on it while the flag is clear; changed under the mutex whenever the flag gets
-    // set.
+    // Waiters sleep on it while the flag is clear; changed whenever the flag gets set.
     FutexWord m_Sequence{0};
 
-    // Guarded by m_Mutex
-    uint32_t m_WaiterCount = 0;  // a killed waiter stays counted, which costs idle wake-ups alone
+    // Guarded by m_Lock, as is every change of m_Sequence
+    uint32_t m_WaiterCount = 0;  // killed ones stay counted, at the price of a system call
     bool m_IsManual = false;
     bool m_IsSignalled = false;
 };
@@ -38,16 +41,17 @@ timespec DeadlineIn(unsigned int timeoutMs) {
     return time;
 }
 
-// Wakes under the mutex: a waiter must not return, and perhaps delete the event, before we are done
-// with it. A flag that is set already has woken whom it could.
+// Wakes whom the signal concerns while the lock is held: a waiter must not return, and perhaps
+// delete the event, before we are done with it. A flag that is set already has woken whom it could.
 void SetLocked(_Event& event) {
     if (event.m_IsSignalled) return;
     event.m_IsSignalled = true;
-    event.m_Sequence.fetch_add(1, std::memory_order_relaxed);
-    if (event.m_WaiterCount) FutexWake(&event.m_Sequence, event.m_IsManual ? INT_MAX : 1);
+    uint32_t sequence = event.m_Sequence.fetch_add(1, std::memory_order_relaxed) + 1;
+    if (!event.m_WaiterCount) return;
+    event.m_Lock.TakeSleepers(event.m_Sequence, sequence, event.m_IsManual ? INT_MAX : 1);
 }
 
-// Sleeps until the flag is set, the time is over or the system refuses. The mutex is held before
+// Sleeps until the flag is set, the time is over or the system refuses. The lock is held before
 // and after, and the caller is inside of one NoKill guard.
 void SleepUntilSet(_Event& event, unsigned int timeoutMs) {
     timespec deadline;
@@ -57,12 +61,12 @@ void SleepUntilSet(_Event& event, unsigned int timeoutMs) {
     int error = 0;
     while (!event.m_IsSignalled && (error == 0 || error == EAGAIN || error == EINTR)) {
         uint32_t seen = event.m_Sequence.load(std::memory_order_relaxed);
-        event.m_Mutex.unlock();
+        event.m_Lock.Release();
         {
-            KillableSleep sleep(&event.m_Sequence);
+            KillableSleep sleep(&event.m_Sequence, &event.m_Lock.Word());
             error = FutexWait(event.m_Sequence, seen, hasLimit ? &deadline : nullptr);
         }
-        event.m_Mutex.lock();
+        event.m_Lock.ObtainAmongWaiters();
     }
     event.m_WaiterCount--;
 }
@@ -83,17 +87,25 @@ void DeleteEvent(_Event* event) {
 }
 
 void SetEvent(_Event* event) {
-    if (!event) return;
     NoKill noKill;
-    std::lock_guard lock(event->m_Mutex);
+    if (const void* sleeper = SetEventQuietly(event)) FutexWake(sleeper, 1);
+}
+
+const void* SetEventQuietly(_Event* event) {
+    if (!event) return nullptr;
+    NoKill noKill;
+    const void* word = &event->m_Lock.Word();
+    event->m_Lock.Obtain();
     SetLocked(*event);
+    return event->m_Lock.ReleaseQuietly() ? word : nullptr;
 }
 
 void ResetEvent(_Event* event) {
     if (!event) return;
     NoKill noKill;
-    std::lock_guard lock(event->m_Mutex);
+    event->m_Lock.Obtain();
     event->m_IsSignalled = false;
+    event->m_Lock.Release();
 }
 
 void PulseEvent(_Event* event) {
@@ -104,15 +116,15 @@ void PulseEvent(_Event* event) {
 bool WaitEvent(_Event* event, unsigned int timeoutMs) {
     if (!event) return false;
     NoKill noKill;
-    std::unique_lock lock(event->m_Mutex, std::defer_lock);
     if (timeoutMs == 0) {
-        if (!lock.try_lock()) return false;
+        if (!event->m_Lock.TryObtain()) return false;
     } else {
-        lock.lock();
+        event->m_Lock.Obtain();
         if (!event->m_IsSignalled) SleepUntilSet(*event, timeoutMs);
     }
     bool isSignalled = event->m_IsSignalled;
     if (!event->m_IsManual) event->m_IsSignalled = false;
+    event->m_Lock.Release();
     return isSignalled;
 }
 

@@ -31,4 +31,55 @@ inline void FutexWake(const void* word, int count) {
     syscall(SYS_futex, word, FUTEX_WAKE_PRIVATE, count, nullptr, nullptr, 0);
 }
 
+// Moves at most `count` sleepers from `from`, which must still be `seen`, to `to`, where they sleep
+// on. Returns how many it moved.
+inline long FutexRequeue(FutexWord& from, uint32_t seen, FutexWord& to, long count) {
+    return syscall(SYS_futex, &from, FUTEX_CMP_REQUEUE_PRIVATE, 0, count, &to, seen);
+}
+
+// A mutex on one futex word. Its waiters cannot be killed, so it is held under NoKill and shortly.
+class FutexLock {
+public:
+    bool TryObtain() {
+        uint32_t free = kFree;
+        return m_Word.compare_exchange_strong(free, kHeld, std::memory_order_acquire);
+    }
+    void Obtain() {
+        if (!TryObtain()) ObtainAmongWaiters();
+    }
+    // For a thread that others may follow in the queue of the word, such as one that has slept
+    // there.
+    void ObtainAmongWaiters() {
+        while (m_Word.exchange(kHeldWithWaiters, std::memory_order_acquire) != kFree) {
+            FutexWait(m_Word, kHeldWithWaiters);
+        }
+    }
+
+    // Moves sleepers of another word here; whoever holds the lock calls it. They run one by one, as
+    // the lock gets free, and not before.
+    void TakeSleepers(FutexWord& from, uint32_t seen, long count) {
+        if (FutexRequeue(from, seen, m_Word, count) > 0) {
+            m_Word.store(kHeldWithWaiters, std::memory_order_relaxed);
+        }
+    }
+
+    // The first part of Release: true when a FutexWake of one sleeper on Word() has to follow. The
+    // lock may be gone by then.
+    [[nodiscard]] bool ReleaseQuietly() {
+        return m_Word.exchange(kFree, std::memory_order_release) == kHeldWithWaiters;
+    }
+    void Release() {
+        if (ReleaseQuietly()) FutexWake(&m_Word, 1);
+    }
+
+    const FutexWord& Word() const { return m_Word; }
+
+private:
+    static constexpr uint32_t kFree = 0;
+    static constexpr uint32_t kHeld = 1;
+    static constexpr uint32_t kHeldWithWaiters = 2;
+
+    FutexWord m_Word{kFree};
+};
+
 }  // namespace Korvel::Platform

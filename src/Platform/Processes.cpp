@@ -9,7 +9,7 @@
 #include "Platform/Mutex.h"
 #include "Platform/NoKillInternal.h"
 #include "core/0ReusePool.h"
-#include "core/TextCell.h"
+#include "core/TextCellInternal.h"
 
 namespace Korvel::Platform {
 namespace {

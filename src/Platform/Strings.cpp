@@ -18,6 +18,7 @@ namespace Korvel::Platform {
 namespace {
 
 constexpr size_t kBlock = 8;  // characters that the short path for ASCII takes at once
+constexpr ptrdiff_t kBlockSteps = kBlock;
 constexpr uint64_t kHighBits = 0x8080808080808080;
 
 // The first code point of each length of sequence, by the number of trail bytes.
@@ -27,7 +28,7 @@ int ToResult(size_t units) {
     return units > INT_MAX ? 0 : static_cast<int>(units);
 }
 
-bool IsAsciiBlock(const char* text) {
+bool IsAsciiBlock(const unsigned char* text) {
     uint64_t bytes;
     memcpy(&bytes, text, kBlock);
     return (bytes & kHighBits) == 0;
@@ -41,7 +42,8 @@ bool IsAsciiBlock(const Wide* text) {
 }
 
 int TrailBytes(uint32_t code) {
-    int trail = 1;
+    if (code < kFirstCode[2]) return 1;
+    int trail = 2;
     while (trail < 5 && code >= kFirstCode[trail + 1]) trail++;
     return trail;
 }
@@ -61,6 +63,12 @@ void PutSequence(char* out, uint32_t code, int trail) {
 bool TakeSequence(const unsigned char*& in, uint32_t& code) {
     unsigned lead = *in;
     if (lead < 0xC2 || lead > 0xFD) return false;
+    if (lead < 0xE0) {  // most of them
+        code = (lead & 0x1F) << 6 | (in[1] & 0x3Fu);
+        bool isValid = (in[1] & 0xC0) == 0x80;
+        in += isValid ? 2 : 0;
+        return isValid;
+    }
     int trail = std::countl_one(static_cast<unsigned char>(lead)) - 1;
     code = lead & (0x3Fu >> trail);
     for (int i = 1; i <= trail; i++) {
@@ -83,20 +91,17 @@ int Encode(const Wide* in, char* out, int size) {
     if (room < 0) return 0;
     char* end = out + room;
     while (in < inEnd) {
-        uint32_t code = static_cast<uint32_t>(*in);
-        if (code < 0x80) {
-            while (inEnd - in >= static_cast<ptrdiff_t>(kBlock) &&
-                   end - p >= static_cast<ptrdiff_t>(kBlock) && IsAsciiBlock(in)) {
-                for (size_t i = 0; i < kBlock; i++) p[i] = static_cast<char>(in[i]);
-                in += kBlock;
-                p += kBlock;
-            }
-            // The block's last character may have been the text's, or the next not be ASCII.
-            if (in == inEnd || static_cast<uint32_t>(*in) >= 0x80) continue;
-            if (p == end) return 0;
-            *p++ = static_cast<char>(*in++);
-            continue;
+        while (inEnd - in >= kBlockSteps && end - p >= kBlockSteps && IsAsciiBlock(in)) {
+            for (size_t i = 0; i < kBlock; i++) p[i] = static_cast<char>(in[i]);
+            in += kBlock;
+            p += kBlock;
         }
+        for (; in < inEnd && static_cast<uint32_t>(*in) < 0x80; in++) {
+            if (p == end) return 0;
+            *p++ = static_cast<char>(*in);
+        }
+        if (in == inEnd) break;
+        uint32_t code = static_cast<uint32_t>(*in);
         if (code > 0x7FFFFFFF) return 0;
         int trail = TrailBytes(code);
         if (end - p <= trail) return 0;
@@ -117,25 +122,25 @@ int Decode(const char* text, Wide* out, int size) {
     const unsigned char* inEnd = in + length;
     Wide* p = out;
     Wide* end = out + std::max(size, 0);
-    while (p < end) {
-        while (inEnd - in >= static_cast<ptrdiff_t>(kBlock) &&
-               end - p >= static_cast<ptrdiff_t>(kBlock) &&
-               IsAsciiBlock(reinterpret_cast<const char*>(in))) {
+    for (;;) {
+        while (inEnd - in >= kBlockSteps && end - p >= kBlockSteps && IsAsciiBlock(in)) {
             for (size_t i = 0; i < kBlock; i++) p[i] = static_cast<Wide>(in[i]);
             in += kBlock;
             p += kBlock;
         }
-        if (p == end) return 0;
-        uint32_t code = *in;
-        if (code < 0x80) {
-            *p++ = static_cast<Wide>(code);
-            if (in++ == inEnd) return static_cast<int>(p - out);
-        } else {
+        for (; *in < 0x80; in++) {
+            if (p == end) return 0;
+            *p++ = static_cast<Wide>(*in);
+            if (in == inEnd) return static_cast<int>(p - out);
+        }
+        // Runs of these are usual, too.
+        while (*in >= 0x80) {
+            uint32_t code;
+            if (p == end) return 0;
             if (!TakeSequence(in, code)) return static_cast<int>(p - out);
             *p++ = static_cast<Wide>(code);
         }
     }
-    return 0;
 }
 
 template <class From, class To>

@@ -47,8 +47,8 @@ struct _Thread : Reuser {
     FutexWord m_Gate{0};
     std::atomic<ThreadFate> m_Fate{ThreadFate::Running};
 
-    // The futex word that the thread sleeps on where a kill may end it; else null.
-    std::atomic<const void*> m_SleepsOn{nullptr};
+    // The futex words, at most two, one of which the thread sleeps on where a kill may end it.
+    std::atomic<const void*> m_SleepsOn[2]{};
 
     // Held, under NoKill, by whoever joins the thread or uses m_OSThread: after the join there must
     // be no call on that handle any more.
@@ -60,19 +60,27 @@ struct _Thread : Reuser {
 extern constinit thread_local _Thread* t_ThisThread __attribute__((tls_model("initial-exec")));
 
 // Lets the current thread be killed while it sleeps on a futex word, inside of its caller's one
-// NoKill guard. Whoever kills it wakes another sleeper of that word in its place: the dead thread
-// may have been chosen for a wake-up that it did not live to act on.
+// NoKill guard; the second word is one that the sleeper may be moved to. Whoever kills it wakes
+// another sleeper in its place: the dead thread may have been chosen for a wake-up that it did not
+// live to act on.
 class KillableSleep {
 public:
-    explicit KillableSleep(const void* word) {
-        if (t_ThisThread) t_ThisThread->m_SleepsOn.store(word, std::memory_order_relaxed);
+    explicit KillableSleep(const void* word, const void* otherWord = nullptr) {
+        Note(word, otherWord);
         AddNoKillDepth(-1);
     }
     KillableSleep(const KillableSleep&) = delete;
     KillableSleep& operator=(const KillableSleep&) = delete;
     ~KillableSleep() {
         AddNoKillDepth(1);
-        if (t_ThisThread) t_ThisThread->m_SleepsOn.store(nullptr, std::memory_order_relaxed);
+        Note(nullptr, nullptr);
+    }
+
+private:
+    static void Note(const void* word, const void* otherWord) {
+        if (!t_ThisThread) return;
+        t_ThisThread->m_SleepsOn[0].store(word, std::memory_order_relaxed);
+        t_ThisThread->m_SleepsOn[1].store(otherWord, std::memory_order_relaxed);
     }
 };
 

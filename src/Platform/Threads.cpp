@@ -369,7 +369,9 @@ bool KillThread(_Thread* thread, unsigned int) {
         isOurs = thread->m_Fate.exchange(ThreadFate::Ended) == ThreadFate::Killed;
         if (isOurs) {
             if (thread->m_Magazine) AbandonMagazine(thread->m_Magazine);
-            if (const void* word = thread->m_SleepsOn) FutexWake(word, 1);
+            for (const void* word : thread->m_SleepsOn) {
+                if (word) FutexWake(word, 1);
+            }
             SetEvent(thread->m_QuitEvent);
         }
     }

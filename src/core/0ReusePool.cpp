@@ -73,6 +73,9 @@ constexpr size_t kHeaderSize = 16;
 constexpr unsigned ClassOf(unsigned long size) {
     return static_cast<unsigned>((size + 7) / 8);
 }
+constexpr unsigned long SizeOf(unsigned k) {
+    return k * 8ul;
+}
 constexpr uint32_t BlockBytes(unsigned k) {
     return k * 8 + kHeaderSize;
 }
@@ -280,7 +283,7 @@ inline void* PoolAccess::Alloc(unsigned long size) {
         Magazine::Rack& rack = magazine->m_Racks[k];
         if (uint32_t count = Get(rack.m_Count)) [[likely]] {
             Set(rack.m_Count, count - 1);
-            return HandOut(rack.m_Slots[count - 1], size, k * 8);
+            return HandOut(rack.m_Slots[count - 1], size, SizeOf(k));
         }
     }
     return AllocSlow(size);
@@ -314,7 +317,7 @@ void* PoolAccess::AllocSlow(unsigned long size) {
     if (size - 1 >= MaxSize()) return NewBlock(size);
     unsigned k = ClassOf(size);
     Block* block = magazine && k < kRackCount ? magazine->Take(k) : TakeOne(k);
-    return block ? HandOut(block, size, k * 8) : NewBlock(k * 8);
+    return block ? HandOut(block, size, SizeOf(k)) : NewBlock(SizeOf(k));
 }
 
 void PoolAccess::FreeSlow(Block* block) {
@@ -329,7 +332,7 @@ void PoolAccess::FreeSlow(Block* block) {
     unsigned k = static_cast<unsigned>(size / 8);
     Poison(block, size);
     if (magazine && k < kRackCount) {
-        block->m_Size = k * 8;  // a block from before the manager's life has its true size
+        block->m_Size = SizeOf(k);  // a block from before the manager's life has its true size
         magazine->Put(k, block);
     } else {
         PutBatch(k, block, block, 1);
@@ -382,7 +385,7 @@ void PoolAccess::PutBatch(unsigned k, Block* first, Block* last, uint32_t length
 PoolAccess::Block* PoolAccess::TakeOne(unsigned k) {
     uint32_t taken;
     Block* block = IsListEmpty(k) ? nullptr : TakeBatch(k, 1, 0, taken);
-    if (block) block->m_Size = k * 8;
+    if (block) block->m_Size = SizeOf(k);
     return block;
 }
 
@@ -484,7 +487,7 @@ Magazine::Block* Magazine::Take(unsigned k) {
         for (uint32_t i = count; i-- > 0;) {
             rack.m_Slots[i] = block;
             Block* next = block->m_Next;
-            block->m_Size = k * 8;
+            block->m_Size = SizeOf(k);
             block = next;
         }
         if (count == 0) return nullptr;

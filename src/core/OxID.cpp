@@ -5,7 +5,7 @@
 #include <cstring>
 
 #include "Platform/Strings.h"
-#include "core/TextCell.h"
+#include "core/TextCellInternal.h"
 
 namespace Korvel {
 namespace {

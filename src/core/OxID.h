@@ -20,7 +20,7 @@ KORVEL_EXPORT uint32_t GetHashValue(const char* text, int length, TagList* tags 
 // An identifier: the name of a member, a key or a message.
 //
 // It is exactly one pointer: null, or a borrowed text that must outlive it, or a counted text cell
-// that it shares (TextCell.h). A literal therefore costs nothing and a copy one atomic step. All
+// that it shares. A literal therefore costs nothing and a copy one atomic step. All
 // text is UTF-8; an empty text and null count as equal.
 //
 // Threads: identifiers that share a cell may be used on several threads, one identifier on one.
@@ -96,7 +96,7 @@ public:
 private:
     static OxID FromCell(const char* cell);  // takes over a new cell
     void Take(const char* cell);             // the same, in place of the present text
-    void SetFormatted(const char* head, const char* format, va_list args);
+    void SetFormatted(const char* head, const char* format, va_list args) KORVEL_PRINTF(3, 0);
 
     const char* m_Text = nullptr;
 };

@@ -353,13 +353,6 @@ bool OxStringT<T>::operator==(const T* text) const {
 }
 
 template <class T>
-bool OxStringT<T>::operator==(const OxStringT& other) const {
-    unsigned long length = Length();
-    return m_Text == other.m_Text ||
-           (length == other.Length() && memcmp(Text(), other.Text(), length * sizeof(T)) == 0);
-}
-
-template <class T>
 int OxStringT<T>::Compare(const T* text) const {
     return text ? Units::Compare(Text(), text) : !IsEmpty();
 }
@@ -575,9 +568,9 @@ int OxStringT<T>::Replace(const T* from, const T* to) {
     if (toLength > kMaxStringLength) return Empty(), 0;
 
     unsigned long total = Length() - count * fromLength + count * toLength;
-    // In place, writing must not overtake reading, nor hit the texts that it goes by.
-    bool inPlace = toLength <= fromLength && !Owns(from) && !Owns(to);
-    T* buffer = inPlace ? GetBuffer(total) : NewBuffer(total);
+    // In place, writing does not overtake reading; a text in our own buffer runs to its end, where
+    // writing arrives only after that text's last use.
+    T* buffer = toLength <= fromLength ? GetBuffer(total) : NewBuffer(total);
     if (!buffer) return Empty(), 0;
     T* out = buffer;
     const T* rest = m_Text;

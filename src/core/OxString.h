@@ -4,6 +4,7 @@
 #include <concepts>
 #include <cstdarg>
 #include <cstdint>
+#include <cstring>
 #include <utility>
 
 #include "core/Export.h"
@@ -117,6 +118,7 @@ public:
     }
 
     OxStringT& operator=(const T* text) { return Set(text), *this; }
+    // NOLINTNEXTLINE(bugprone-unhandled-self-assignment): Set shares before it lets go
     OxStringT& operator=(const OxStringT& other) { return Set(other), *this; }
     OxStringT& operator=(OxStringT&& other) noexcept { return Set(std::move(other)), *this; }
     OxStringT& operator=(const OxID& id) requires ByteUnit<T> {
@@ -209,7 +211,11 @@ public:
     // and only A to Z have a case.
 
     bool operator==(const T* text) const;  // null and empty are equal
-    bool operator==(const OxStringT& other) const;
+    bool operator==(const OxStringT& other) const {
+        unsigned long length = Length();
+        return m_Text == other.m_Text ||
+               (length == other.Length() && memcmp(Text(), other.Text(), length * sizeof(T)) == 0);
+    }
     bool operator==(const OxID& id) const requires ByteUnit<T> {
         return *this == static_cast<const char*>(id);
     }

@@ -10,7 +10,7 @@
 #include "core/OxID.h"
 #include "core/OxString.h"
 #include "core/OxStringInternal.h"
-#include "core/TextCell.h"
+#include "core/TextCellInternal.h"
 
 namespace Korvel {
 namespace {

@@ -1,10 +1,9 @@
-#include "core/TextCell.h"
-
 #include <cassert>
 #include <climits>
 #include <cstring>
 
 #include "core/0ReusePool.h"
+#include "core/TextCellInternal.h"
 
 namespace Korvel::TextCell {
 namespace {
@@ -12,6 +11,7 @@ namespace {
 // count, marker and terminator
 constexpr unsigned long kOverhead = sizeof(uint32_t) + 2;
 
+#ifndef NDEBUG
 // Debug builds sign the unused header word of a cell's block, so that Check can tell a cell from a
 // foreign text that merely begins with the marker.
 constexpr uint64_t kSignature = 0x6C6C65436F725478;
@@ -20,6 +20,7 @@ uint64_t& UnusedHeaderWord(const char* cell) {
     char* block = const_cast<char*>(cell) - sizeof(uint32_t);
     return reinterpret_cast<uint64_t*>(block)[-1];
 }
+#endif
 
 }  // namespace
 

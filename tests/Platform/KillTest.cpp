@@ -2,6 +2,7 @@
 // the search for leaks: what a killed thread owned is lost, and that is how it should be.
 #include <gtest/gtest.h>
 #include <pthread.h>
+#include <sched.h>
 #include <signal.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -136,30 +137,71 @@ TEST(Kill, NotYetStarted) {
     EXPECT_FALSE(hasRun);
 }
 
+// Keeps the test and the threads that it starts on one processor, where a thread of the idle policy
+// does not run before the test itself sleeps.
+class OneProcessor {
+public:
+    OneProcessor() {
+        sched_getaffinity(0, sizeof m_Before, &m_Before);
+        cpu_set_t one;
+        CPU_ZERO(&one);
+        CPU_SET(sched_getcpu(), &one);
+        sched_setaffinity(0, sizeof one, &one);
+    }
+    ~OneProcessor() { sched_setaffinity(0, sizeof m_Before, &m_Before); }
+
+private:
+    cpu_set_t m_Before;
+};
+
+bool IsAsleep(_Thread* thread) {
+    std::ifstream file("/proc/self/task/" + std::to_string(GetThreadID(thread)) + "/stat");
+    std::string text;
+    std::getline(file, text);
+    return text.find(") S ") != std::string::npos;
+}
+
+void WaitUntilAsleep(_Thread* thread) {
+    unsigned long long limit = GetTimeCount() + kLong / 1000 * GetTimeFreq();
+    while (!IsAsleep(thread) && GetTimeCount() < limit) Wait(1);
+}
+
+void MakeIdle() {
+    sched_param param{};
+    pthread_setschedparam(pthread_self(), SCHED_IDLE, &param);
+}
+
 TEST(Kill, WaiterLeavesTheEventWhole) {
-    for (int i = 0; i < 50; i++) {
+    OneProcessor oneProcessor;
+    for (int i = 0; i < 30; i++) {
         struct Shared {
             EventHolder m_Event, m_IsAtWork;
+            std::atomic<int> m_Taken{0};
+            std::atomic<int> m_Started{0};
             static unsigned long long WaitForEver(void* argument) {
                 auto* shared = static_cast<Shared*>(argument);
+                if (shared->m_Started++ == 0) MakeIdle();  // the victim
                 SetEvent(shared->m_IsAtWork.m_Event);
-                return WaitEvent(shared->m_Event.m_Event, kNoTimeLimit);
+                if (WaitEvent(shared->m_Event.m_Event, kNoTimeLimit)) shared->m_Taken++;
+                return 0;
             }
         } shared;
+        _Event* event = shared.m_Event.m_Event;
         _Thread* victim = Start(Shared::WaitForEver, &shared, shared.m_IsAtWork.m_Event);
+        WaitUntilAsleep(victim);  // it is the first in the event's queue
         _Thread* survivor = Start(Shared::WaitForEver, &shared, shared.m_IsAtWork.m_Event);
-        if (i % 2) {
-            // The victim may have been chosen for the wake-up. Then it hands it on, or it has made
-            // use of it, which the event shows.
-            SetEvent(shared.m_Event.m_Event);
-            bool hasVictimTaken = WaitThread(victim, 0);
+        WaitUntilAsleep(survivor);
+        if (i % 3) {
+            // The signal is the victim's. It must not lie there while the other one sleeps.
+            SetEvent(event);
             ExpectKilled(victim);
-            if (!hasVictimTaken && !WaitThread(survivor, 50)) SetEvent(shared.m_Event.m_Event);
-            if (hasVictimTaken) SetEvent(shared.m_Event.m_Event);
+            if (!shared.m_Taken && !WaitThread(survivor, 2000)) {
+                EXPECT_FALSE(WaitEvent(event, 0));
+            }
         } else {
             ExpectKilled(victim);
-            SetEvent(shared.m_Event.m_Event);
         }
+        SetEvent(event);
         EXPECT_TRUE(WaitThread(survivor, kLong));
         DeleteThread(survivor);
     }
@@ -188,6 +230,26 @@ TEST(Kill, WaiterForALockLeavesItWhole) {
         ReleaseMutex(shared.m_Mutex);
         DeleteMutex(shared.m_Mutex);
     }
+}
+
+TEST(Kill, GivesBackTheThreadsFreeBlocks) {
+    constexpr unsigned long kSize = 968;  // a class that nothing else here uses
+    struct Shared {
+        EventHolder m_IsAtWork;
+        std::vector<void*> m_Blocks = std::vector<void*>(8);
+        static unsigned long long FreeAndLoop(void* argument) {
+            auto* shared = static_cast<Shared*>(argument);
+            for (void*& block : shared->m_Blocks) block = g_ReusePoolMgr.Alloc(kSize);
+            for (void* block : shared->m_Blocks) g_ReusePoolMgr.Free(block);
+            return LoopForEver(shared->m_IsAtWork.m_Event);
+        }
+    } shared;
+    g_ReusePoolMgr.FreeAll();
+    ExpectKilled(Start(Shared::FreeAndLoop, &shared, shared.m_IsAtWork.m_Event));
+    void* block = g_ReusePoolMgr.Alloc(kSize);
+    EXPECT_NE(std::find(shared.m_Blocks.begin(), shared.m_Blocks.end(), block),
+              shared.m_Blocks.end());
+    g_ReusePoolMgr.Free(block);
 }
 
 // Threads that do nothing but use pools and queues, killed at any moment.

@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "core/FaultsInternal.h"
-#include "core/TextCell.h"
+#include "core/TextCellInternal.h"
 
 namespace Korvel {
 namespace {
@@ -180,8 +180,9 @@ TEST(OxID, BecomesNullWhereMemoryRunsOut) {
 TEST(OxIDDeathTest, AForeignTextWithTheMarkerIsCaught) {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
     alignas(16) char memory[64] = {};
-    memory[40] = TextCell::kMarker;
-    EXPECT_DEATH(OxID(memory + 40, true), "0xFF");
+    char* text = memory + 36;  // as far behind an aligned address as a cell's
+    *text = TextCell::kMarker;
+    EXPECT_DEATH(OxID(text, true), "0xFF");
     EXPECT_EQ(TextCell::SafeFirstByte('\xFF'), '?');
     EXPECT_EQ(TextCell::SafeFirstByte('\xFE'), '\xFE');
 }

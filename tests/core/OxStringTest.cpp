@@ -174,10 +174,8 @@ TYPED_TEST(OxStringTest, EditsAsTheModelDoes) {
                 break;
         }
         ASSERT_EQ(Content(string), model) << "operation " << operation << " in step " << step;
-        ASSERT_EQ(string.Find(argument, 1), length > 1 && model.size() > 1
-                                                ? static_cast<int>(model.find(Model(argument), 1))
-                                                : -1)
-            << step;
+        int found = model.size() > 1 ? static_cast<int>(model.find(text, 1)) : -1;
+        ASSERT_EQ(string.Find(text.c_str(), 1), found) << step;
         ASSERT_EQ(string.ReverseFind(c), static_cast<int>(model.rfind(c)));
     }
     EXPECT_EQ(Content(copy), copyModel);
@@ -288,7 +286,7 @@ TYPED_TEST(OxStringTest, ToleratesANullPointer) {
     check([&](String& s) { s.Insert(5, ab); }, "ab");
     check([&](String& s) { s.Set(s, ab); }, "ab");
     check([&](String& s) { s = String(s, s) + ab; }, "ab");
-    String* noObject = nullptr;
+    String* volatile noObject = nullptr;  // or compilers warn
     EXPECT_FALSE(noObject->IsValid());
 }
 
@@ -401,6 +399,7 @@ TYPED_TEST(OxStringTest, TrimsAndCase) {
     EXPECT_EQ(Content(odd).size(), before.size());
 }
 
+#ifdef KORVEL_FAULTS
 TYPED_TEST(OxStringTest, FailsToAnEmptyTextWhereMemoryRunsOut) {
     using String = OxStringT<TypeParam>;
     auto text = Wide<TypeParam>("x");
@@ -410,7 +409,8 @@ TYPED_TEST(OxStringTest, FailsToAnEmptyTextWhereMemoryRunsOut) {
     const std::function<void(String&)> operations[] = {
         [&](String& s) { s = x; },
         [&](String& s) { s = String(s, x); },
-        [&](String& s) { s = x + s / x; },
+        [&](String& s) { s = s / x; },
+        [&](String& s) { s = x + s; },
         [&](String& s) { s += s; },
         [&](String& s) { s.Insert(1, x); },
         [&](String& s) { s.Delete(0, 1); },
@@ -458,6 +458,7 @@ TYPED_TEST(OxStringTest, FailsToAnEmptyTextWhereMemoryRunsOut) {
         }
     }
 }
+#endif
 
 TYPED_TEST(OxStringTest, EndsWhereLengthsDo) {
     OxStringT<TypeParam> big;
@@ -503,6 +504,29 @@ TEST(OxString, ComparesLikeTheCLibrary) {
     EXPECT_LT(ucs4.CompareNoCase(U"C"), 0);
     EXPECT_NE(OxStringT<char32_t>(U"Ä").CompareNoCase(U"ä"), 0);
     EXPECT_EQ(OxStringT<char>("\xFF").GetChar(0), -1);
+}
+
+// Each form of text finds its own overload.
+TEST(OxString, BuildsFromParts) {
+    using String = OxStringT<char>;
+    OxID id("id", true);
+    String s("ab", "cd");
+    EXPECT_STREQ(String(s, "efgh", 2ul), "abcdef");
+    EXPECT_STREQ(String("x", s), "xabcd");
+    EXPECT_STREQ(String(s, s), "abcdabcd");
+    EXPECT_STREQ(String(s, 3ul), "abc");
+    EXPECT_STREQ(String(nullptr, "x"), "x");
+    EXPECT_STREQ(s + 'e' + String("f") + id + L"g" + OxStringT<char32_t>(U"h"), "abcdefidgh");
+    EXPECT_STREQ(String('c') / String("d"), "c/d");
+    s = id;
+    s += id;
+    s += U'i';
+    EXPECT_STREQ(s, "ididi");
+    s.Set(OxID());
+    EXPECT_TRUE(s.IsEmpty());
+    s = s = "self";
+    s = *&s;
+    EXPECT_STREQ(s, "self");
 }
 
 TEST(OxString, Formats) {
@@ -678,12 +702,14 @@ TEST(CharGroups, MarksBelongToTheCharacterBefore) {
     EXPECT_EQ(CharGroups(U"").m_Count, 0);
     const char32_t noCharacters[] = {0x110000, 0x80000000, 0xFFFFFFFF, 0};
     EXPECT_EQ(CharGroups(noCharacters).m_Count, 3);
+#ifdef KORVEL_FAULTS
     OxStringT<char32_t> text(U"ab");
     Faults::FailAt(1, true);
     CharGroups failed(text);
     Faults::Stop();
     EXPECT_EQ(failed.m_Count, 0);
     EXPECT_EQ(failed.m_Offsets, nullptr);
+#endif
 }
 
 }  // namespace

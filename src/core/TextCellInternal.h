@@ -3,8 +3,6 @@
 #include <atomic>
 #include <cstdint>
 
-#include "core/Export.h"
-
 namespace Korvel {
 
 // The counted text that identifiers and values share.
@@ -22,13 +20,13 @@ constexpr char kMarker = '\xFF';
 
 // A new cell with count 1 and room for `length` bytes; the marker and the last NUL stand, the text
 // is the caller's to write. Null when memory has run out.
-KORVEL_EXPORT char* New(unsigned long length);
+char* New(unsigned long length);
 
 // Asserts in debug builds that `cell` points at a cell's marker.
 #ifdef NDEBUG
 inline void Check(const char* cell) {}
 #else
-KORVEL_EXPORT void Check(const char* cell);
+void Check(const char* cell);
 #endif
 
 inline bool IsCell(const char* p) {
@@ -53,7 +51,7 @@ inline const char* Use(const char* p) {
     return p;
 }
 
-KORVEL_EXPORT void Free(const char* cell);
+void Free(const char* cell);
 
 // Drops a holder, if the pointer is to a cell; the last one frees it.
 inline void Drop(const char* p) {
