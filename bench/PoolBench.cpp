@@ -1,6 +1,7 @@
 // The reuse pools beside malloc and whatever other allocators this machine has: mimalloc, jemalloc
 // and tcmalloc are looked up at run time. All are called the same way, through a pointer.
 #include <dlfcn.h>
+#include <unistd.h>
 
 #include <array>
 #include <atomic>
@@ -124,6 +125,12 @@ void HandOver(benchmark::State& state, const Allocator& allocator) {
 }  // namespace
 
 int main(int argc, char** argv) {
+    // jemalloc wants more thread-local space than a library loaded late is given by default, and
+    // the amount is fixed when a process starts.
+    if (!getenv("GLIBC_TUNABLES")) {
+        setenv("GLIBC_TUNABLES", "glibc.rtld.optional_static_tls=65536", 1);
+        execv("/proc/self/exe", argv);
+    }
     for (const Allocator& allocator : FindAllocators()) {
         auto add = [&](const char* row, void (*body)(benchmark::State&, const Allocator&)) {
             return benchmark::RegisterBenchmark((std::string(row) + "@" + allocator.m_Name).c_str(),
