@@ -13,7 +13,9 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <bit>
 #include <climits>
+#include <cmath>
 #include <cstdio>
 #include <cstring>
 
@@ -245,7 +247,7 @@ void* s_threadfunc(void* argument) {
     }
     WaitForGate(self);
     BodyEnd end{self};
-    return reinterpret_cast<void*>(self->m_Entry(self->m_Argument));
+    return std::bit_cast<void*>(self->m_Entry(self->m_Argument));
 }
 
 #if defined(__x86_64__) || defined(__i386__)
@@ -445,7 +447,7 @@ ThreadPri GetThreadPriority(_Thread* thread) {
     }
     float part =
         static_cast<float>(param.sched_priority - lowest) / static_cast<float>(highest - lowest);
-    return static_cast<ThreadPri>(part * 6 + 0.5f);
+    return static_cast<ThreadPri>(std::lround(part * 6));
 }
 
 void SetThreadName(const char* name, _Thread*) {

@@ -35,7 +35,9 @@ TEST(Events, SignalsByKindAndState) {
         {false, true, "10"},        // a look consumes the signal
         {false, false, "P0SP0S1"},  // a pulse that nobody sees leaves nothing, not even what was
                                     // set
-        {false, true, "R0"},       {true, false, "0S111R0"}, {true, true, "11P0"},
+        {false, true, "R0"},
+        {true, false, "0S111R0"},
+        {true, true, "11P0"},
     };
     for (const Case& c : cases) {
         _Event* event = NewEvent(c.manualReset, c.initialState);

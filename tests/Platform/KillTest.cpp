@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <fstream>
 #include <lua.hpp>
 #include <random>
 #include <string>
