@@ -51,6 +51,7 @@ public:
     OxID& operator+=(const char* text);
     OxID& operator+=(char c);
     OxID operator+(const char* text) const;
+    OxID operator+(const OxID& other) const { return *this + other.m_Text; }
     KORVEL_EXPORT friend OxID operator+(const char* text, const OxID& id);
 
     // Null and empty are equal; otherwise the bytes decide, case included.
