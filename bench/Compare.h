@@ -26,8 +26,9 @@ public:
             if (at == std::string::npos || run.error_occurred) continue;
             size_t end = name.find('/', at);
             std::string rest = end == std::string::npos ? "" : name.substr(end);
+            // With several threads the library divides by the sum of what they have done.
             Add(name.substr(0, at) + rest, name.substr(at + 1, end - at - 1),
-                run.GetAdjustedRealTime());
+                run.GetAdjustedRealTime() * static_cast<double>(run.threads));
         }
         ConsoleReporter::ReportRuns(runs);
     }

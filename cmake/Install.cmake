@@ -28,7 +28,6 @@ install(FILES
     ${CMAKE_CURRENT_BINARY_DIR}/korvelscriptConfigVersion.cmake
     DESTINATION ${KORVEL_PACKAGE_DIR}
 )
-# The prefix is filled in when the tree is installed, so that --prefix holds for pkg-config, too.
 # Relative to the file itself, so that `--prefix` and a moved tree hold for pkg-config, too.
 file(RELATIVE_PATH KORVEL_PC_TO_PREFIX /prefix/${CMAKE_INSTALL_LIBDIR}/pkgconfig /prefix)
 configure_file(cmake/korvelscript.pc.in ${CMAKE_CURRENT_BINARY_DIR}/korvelscript.pc @ONLY)

@@ -2,7 +2,7 @@
 # Everything here writes to standard error, so that a script's own output stays clean.
 
 run_packages="g++ cmake ninja-build pkg-config libluajit-5.1-dev lua-lpeg-dev libfribidi-dev"
-test_packages="$run_packages libgtest-dev"
+test_packages="$run_packages libgtest-dev locales"
 
 # need PACKAGE...: installs those that are missing, in one step.
 need() {
@@ -26,7 +26,8 @@ need() {
     { $apt update && $apt install -y --no-install-recommends $missing; } >&2
 }
 
-# build PRESET [TARGET...]: configures when that has not been done, and builds when there is work.
+# build PRESET [TARGET...]: configures when that has not been done with the same KORVEL_CMAKE_ARGS,
+# and builds when there is work.
 # Two at a time on one folder wait for each other.
 build() {
     preset=$1
@@ -35,7 +36,8 @@ build() {
     mkdir -p "$folder"
     (
         flock 9
-        if [ ! -f "$folder/build.ninja" ]; then
+        arguments=$(cat "$folder/arguments" 2>/dev/null) || arguments=
+        if [ ! -f "$folder/build.ninja" ] || [ "$arguments" != "${KORVEL_CMAKE_ARGS:-}" ]; then
             echo "Configuring the $preset build" >&2
             # shellcheck disable=SC2086
             (cd "$root" && cmake --preset "$preset" ${KORVEL_CMAKE_ARGS:-}) \
@@ -43,6 +45,7 @@ build() {
                 cat "$folder/configure.log" >&2
                 exit 1
             }
+            echo "${KORVEL_CMAKE_ARGS:-}" >"$folder/arguments"
         fi
         ninja -C "$folder" -n "$@" 2>&1 | grep -q 'no work to do' || ninja -C "$folder" "$@" >&2
     ) 9>"$folder/.lock"

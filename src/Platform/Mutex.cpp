@@ -1,23 +1,14 @@
 #include "Platform/Mutex.h"
 
+#include "Platform/MutexInternal.h"
 #include "Platform/ThreadInternal.h"
 
 namespace Korvel::Platform {
 
-struct _Mutex : Reuser {
-    pthread_mutex_t m_Mutex;
-};
-
 _Mutex* NewMutex(bool initialOwner) {
     NoKill noKill;
     _Mutex* mutex = new _Mutex;
-    if (!mutex) return nullptr;
-    pthread_mutexattr_t attributes;
-    pthread_mutexattr_init(&attributes);
-    pthread_mutexattr_settype(&attributes, PTHREAD_MUTEX_RECURSIVE);
-    pthread_mutex_init(&mutex->m_Mutex, &attributes);
-    pthread_mutexattr_destroy(&attributes);
-    if (initialOwner) pthread_mutex_lock(&mutex->m_Mutex);
+    if (mutex && initialOwner) pthread_mutex_lock(&mutex->m_Mutex);
     return mutex;
 }
 
@@ -28,15 +19,19 @@ void DeleteMutex(_Mutex* mutex) {
     delete mutex;
 }
 
+bool ObtainMutexGuarded(_Mutex& mutex, unsigned int timeoutMs) {
+    int error = pthread_mutex_trylock(&mutex.m_Mutex);
+    if (error == EBUSY && timeoutMs) {
+        KillableSleep sleep(&mutex.m_Mutex);  // its first word is the one that waiters sleep on
+        error = pthread_mutex_lock(&mutex.m_Mutex);
+    }
+    return error == 0;
+}
+
 bool ObtainMutex(_Mutex* mutex, unsigned int timeoutMs) {
     if (!mutex) return false;
     NoKill noKill;
-    int error = pthread_mutex_trylock(&mutex->m_Mutex);
-    if (error == EBUSY && timeoutMs) {
-        KillableSleep sleep(&mutex->m_Mutex);  // its first word is the one that waiters sleep on
-        error = pthread_mutex_lock(&mutex->m_Mutex);
-    }
-    return error == 0;
+    return ObtainMutexGuarded(*mutex, timeoutMs);
 }
 
 void ReleaseMutex(_Mutex* mutex) {

@@ -6,7 +6,8 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "Platform/Mutex.h"
+#include "Platform/Events.h"
+#include "Platform/MutexInternal.h"
 #include "Platform/NoKillInternal.h"
 #include "core/0ReusePool.h"
 #include "core/TextCellInternal.h"
@@ -14,12 +15,16 @@
 namespace Korvel::Platform {
 namespace {
 
-// Made by whoever comes first, be it another static initialiser, and never deleted: threads may ask
-// for a setting while the process ends.
-_Mutex* EnvMutex() {
-    static _Mutex* const s_EnvMutex = NewMutex(false);
-    return s_EnvMutex;
-}
+// Constant-initialised and never destroyed: other static initialisers, and threads that still run
+// while the process ends, may ask for a setting.
+struct ImmortalMutex {
+    union {
+        _Mutex m_Mutex;
+    };
+    constexpr ImmortalMutex() : m_Mutex() {}
+    ~ImmortalMutex() {}
+};
+constinit ImmortalMutex s_EnvMutex;
 
 // A text that was handed to putenv, which keeps the pointer. The chain is what owns them.
 struct EnvString {
@@ -28,9 +33,10 @@ struct EnvString {
 };
 constinit EnvString* s_EnvStrings = nullptr;  // guarded by the environment lock
 
+// Holds the environment lock until the end of its scope, and keeps kills away meanwhile.
 class AutoEnvLock {
 public:
-    AutoEnvLock() { ObtainEnvLock(); }
+    AutoEnvLock() { ObtainMutexGuarded(s_EnvMutex.m_Mutex, kNoTimeLimit); }
     AutoEnvLock(const AutoEnvLock&) = delete;
     AutoEnvLock& operator=(const AutoEnvLock&) = delete;
     ~AutoEnvLock() { ReleaseEnvLock(); }
@@ -45,10 +51,10 @@ char** GetEnviron() {
     return environ;
 }
 void ObtainEnvLock() {
-    ObtainMutex(EnvMutex(), 0xFFFFFFFF);
+    ObtainMutex(&s_EnvMutex.m_Mutex, kNoTimeLimit);
 }
 void ReleaseEnvLock() {
-    ReleaseMutex(EnvMutex());
+    ReleaseMutex(&s_EnvMutex.m_Mutex);
 }
 
 bool GetEnv(const char* name, OxStringT<char>& value) {
@@ -58,11 +64,14 @@ bool GetEnv(const char* name, OxStringT<char>& value) {
     for (char** entry = environ; entry && *entry; entry++) {
         if (strncasecmp(*entry, name, length) != 0 || (*entry)[length] != '=') continue;
         const char* found = *entry + length + 1;
+        OxStringT<char> copy;
         if (TextCell::IsCell(found)) {
-            value.Set("?", found + 1);
+            copy.Set("?", found + 1);
         } else {
-            value.Set(found);
+            copy.Set(found);
         }
+        if (*found && copy.IsEmpty()) return false;
+        value = std::move(copy);
         return true;
     }
     return false;
@@ -75,9 +84,14 @@ bool PutEnv(const char* setting) {
     EnvString* kept = static_cast<EnvString*>(g_ReusePoolMgr.Alloc(sizeof(EnvString) + size));
     if (!kept) return false;
     memcpy(kept->m_Text, setting, size);
-    kept->m_Next = s_EnvStrings;
-    s_EnvStrings = kept;
-    return putenv(kept->m_Text) == 0;
+    bool isDone = putenv(kept->m_Text) == 0;
+    if (isDone && strchr(setting, '=')) {
+        kept->m_Next = s_EnvStrings;
+        s_EnvStrings = kept;
+    } else {  // a variable was taken out, or nothing happened
+        g_ReusePoolMgr.Free(kept);
+    }
+    return isDone;
 }
 
 }  // namespace Korvel::Platform

@@ -13,7 +13,7 @@ KORVEL_EXPORT void ReleaseEnvLock();
 
 // Copies the value of the first variable whose name is `name`, the case of letters set aside.
 // Returns false, and leaves `value` alone, when there is none. A value that begins with byte 0xFF,
-// which no text may, gets a '?' in its place.
+// which no text may, gets a '?' in its place. Without the memory for a copy it is false, too.
 KORVEL_EXPORT bool GetEnv(const char* name, OxStringT<char>& value);
 
 // Puts "NAME=value" into the environment, or takes NAME out of it when `setting` has no '='. The

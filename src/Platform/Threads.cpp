@@ -7,7 +7,6 @@
 // kill that gives up takes its KillAsked back, and when it cannot, the handler has been faster.
 #include "Platform/Threads.h"
 
-#include <locale.h>
 #include <sched.h>
 #include <signal.h>
 #include <sys/syscall.h>
@@ -20,6 +19,7 @@
 #include <cstring>
 
 #include "Platform/Events.h"
+#include "Platform/LocaleInternal.h"
 #include "Platform/Platform.h"
 #include "Platform/ThreadInternal.h"
 #include "Platform/Time.h"
@@ -418,11 +418,17 @@ void _SetCurrentThread() {
     t_ThisThread = thread;
 }
 
+locale_t CLocale() {
+    NoKill noKill;
+    // The C library keeps this one ready, so it takes no memory and cannot fail.
+    static const locale_t s_CLocale = newlocale(LC_ALL_MASK, "C", nullptr);
+    return s_CLocale;
+}
+
 void InitThread() {
     SetFloatState();
     // setlocale would change the whole process.
-    static const locale_t s_CLocale = newlocale(LC_ALL_MASK, "C", nullptr);
-    if (s_CLocale) uselocale(s_CLocale);
+    uselocale(CLocale());
 }
 
 void SetThreadPriority(_Thread* thread, ThreadPri priority) {

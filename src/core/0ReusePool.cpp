@@ -167,7 +167,7 @@ constinit Count s_NextSerial{1};
 
 // Stand-ins, so that the short path needs no test for null: their epoch never comes.
 constinit Magazine s_NoMagazine{.m_Epoch = kNoEpoch};    // the thread has not allocated yet
-constinit Magazine s_GoneMagazine{.m_Epoch = kNoEpoch};  // the thread is ending
+constinit Magazine s_GoneMagazine{.m_Epoch = kNoEpoch};  // the thread is ending, or goes without
 
 constinit thread_local Magazine* t_Magazine __attribute__((tls_model("initial-exec"))) =
     &s_NoMagazine;
@@ -176,6 +176,7 @@ constinit SpinLock s_RegistryLock;
 constinit Magazine* s_Registry = nullptr;  // all magazines but the stand-ins
 constinit uint32_t s_ForkCounts[ReusePoolManager::kClassCount] = {};
 pthread_key_t s_ExitKey;
+constinit bool s_HasExitKey = false;  // without one, nobody would give back a magazine
 
 void Poison(PoolAccess::Block* block, size_t size) {
 #ifdef KORVEL_POISONING
@@ -198,7 +199,7 @@ Magazine* CurrentMagazine() {
     Magazine* magazine = t_Magazine;
     if (magazine == &s_GoneMagazine) return nullptr;
     if (magazine == &s_NoMagazine) {
-        if (!PoolAccess::MaxSize()) return nullptr;
+        if (!PoolAccess::MaxSize() || !s_HasExitKey) return nullptr;
         magazine = Magazine::New();
         if (!magazine) return nullptr;
         if (pthread_setspecific(s_ExitKey, magazine) != 0) {
@@ -251,6 +252,7 @@ uint64_t CountInMagazines(unsigned k) {
 // that it did not copy are lost to the child.
 
 void BeforeFork() {
+    Platform::AddNoKillDepth(1);
     s_RegistryLock.Obtain();
     for (unsigned k = 1; k <= ReusePoolManager::kClassCount; k++) {
         s_ForkCounts[k - 1] = PoolAccess::LockClass(k);
@@ -262,6 +264,7 @@ void AfterForkInParent() {
         PoolAccess::UnlockClass(k, s_ForkCounts[k - 1]);
     }
     s_RegistryLock.Release();
+    Platform::AddNoKillDepth(-1);
 }
 
 void AfterForkInChild() {
@@ -541,7 +544,7 @@ void Magazine::Empty() {
 __attribute__((init_priority(101))) ReusePoolManager g_ReusePoolMgr;
 
 ReusePoolManager::ReusePoolManager() : m_Lists{}, m_Locks{} {
-    pthread_key_create(&s_ExitKey, OnThreadExit);
+    s_HasExitKey = pthread_key_create(&s_ExitKey, OnThreadExit) == 0;
     pthread_atfork(BeforeFork, AfterForkInParent, AfterForkInChild);
     m_MaxSize.store(kMaxSize, std::memory_order_relaxed);
 }
@@ -582,7 +585,9 @@ void ReusePoolManager::FreeAll() {
 
 Magazine* ObtainMagazine() {
     Platform::NoKill noKill;
-    return CurrentMagazine();
+    Magazine* magazine = CurrentMagazine();
+    if (!magazine) t_Magazine = &s_GoneMagazine;
+    return magazine;
 }
 
 void AbandonMagazine(Magazine* magazine) {

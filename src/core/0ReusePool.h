@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
+#include <new>
 
 #include "core/Export.h"
 
@@ -19,8 +20,7 @@ namespace Korvel {
 // Layout:    every block is a malloc block of its own with a 16-byte header. Its first word is the
 //            user size while the block is in use and the next free block while it is not.
 // Life:      there is one manager, g_ReusePoolMgr. It works before its constructor has run and
-// after
-//            its destructor: blocks then come from malloc and go to free.
+//            after its destructor: blocks then come from malloc and go to free.
 // Threads:   any thread may free a block that another one allocated. Threads that end give back
 //            their magazines; a forked child forgets those of the threads it does not have.
 // Failure:   Alloc returns null when malloc does. Nothing throws.
@@ -82,6 +82,7 @@ public:
     static void* operator new(size_t size) noexcept;
     static void* operator new[](size_t size) noexcept;
     static void* operator new(size_t, void* where) noexcept { return where; }
+    static void* operator new(size_t, std::align_val_t) = delete;  // blocks are aligned to 16
     static void operator delete(void* p) noexcept;
     static void operator delete[](void* p) noexcept;
 };

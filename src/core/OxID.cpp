@@ -21,13 +21,19 @@ const char* OrEmpty(const char* text) {
     return text ? text : "";
 }
 
+// What a foreign text holds inside may come to stand at the head of a new one.
+char* Finish(char* cell) {
+    cell[1] = TextCell::SafeFirstByte(cell[1]);
+    return cell;
+}
+
 // A cell with the first `aLength` bytes of `a`, then the first `bLength` of `b`.
 char* NewCell(const char* a, size_t aLength, const char* b = "", size_t bLength = 0) {
     char* cell = TextCell::New(aLength + bLength);
     if (!cell) return nullptr;
     memcpy(cell + 1, a, aLength);
     memcpy(cell + 1 + aLength, b, bLength);
-    return cell;
+    return Finish(cell);
 }
 
 // A cell with the whole of one text, or of two; null texts are left out, all null gives null.
@@ -122,9 +128,14 @@ void OxID::Set(const OxID& other) {
     Take(TextCell::Use(other.m_Text));
 }
 
+// True for a text inside of our own cell, which goes when another text takes its place.
+bool OxID::Owns(const char* text) const {
+    return TextCell::IsCell(m_Text) && text > m_Text && text <= m_Text + 1 + GetLength();
+}
+
 void OxID::Set(const char* text, bool copy) {
     bool isPlain = text && !TextCell::IsCell(text);
-    Take(isPlain && copy ? NewCell(text) : TextCell::Use(text));
+    Take(isPlain && (copy || Owns(text)) ? NewCell(text) : TextCell::Use(text));
 }
 
 void OxID::Set(const char* a, const char* b) {
@@ -146,8 +157,9 @@ OxID& OxID::operator+=(const char* text) {
 }
 
 OxID& OxID::operator+=(char c) {
-    const char text[] = {c, '\0'};
-    return *this += text;
+    const char* text = OrEmpty(*this);
+    Take(NewCell(text, strlen(text), &c, c ? 1 : 0));
+    return *this;
 }
 
 OxID OxID::operator+(const char* text) const {
@@ -263,6 +275,7 @@ void OxID::SetFormatted(const char* head, const char* format, va_list args) {
     if (cell) {
         memcpy(cell + 1, OrEmpty(head), headLength);
         vsnprintf(cell + 1 + headLength, static_cast<size_t>(length) + 1, format, again);
+        Finish(cell);
     }
     va_end(again);
     Take(cell);

@@ -40,6 +40,8 @@ public:
     ~OxID();
 
     OxID& operator=(const OxID& other);
+    OxID& operator=(const char* text) { return Set(text), *this; }  // borrows
+    OxID& operator=(const OxStringT<char>& text) { return *this = OxID(text); }
     OxID& operator=(OxID&& other) noexcept;
     void Set(const OxID& other);
     void Set(const char* text, bool copy = false);
@@ -97,6 +99,7 @@ public:
 private:
     static OxID FromCell(const char* cell);  // takes over a new cell
     void Take(const char* cell);             // the same, in place of the present text
+    bool Owns(const char* text) const;
     void SetFormatted(const char* head, const char* format, va_list args) KORVEL_PRINTF(3, 0);
 
     const char* m_Text = nullptr;

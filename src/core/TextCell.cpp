@@ -1,6 +1,6 @@
 #include <cassert>
 #include <climits>
-#include <cstring>
+#include <new>
 
 #include "core/0ReusePool.h"
 #include "core/TextCellInternal.h"

@@ -1,10 +1,9 @@
 #include "diag/Env.h"
 
-#include <locale.h>
-
 #include <climits>
 #include <cstdlib>
 
+#include "Platform/LocaleInternal.h"
 #include "Platform/Processes.h"
 
 namespace Korvel {
@@ -26,11 +25,6 @@ bool FindSetting(const char* rest, OxStringT<char>& value) {
     }
     name.PrintF("KORVEL_%s", rest);
     return Platform::GetEnv(name, value);
-}
-
-double ParseDouble(const char* text) {
-    static const locale_t cLocale = newlocale(LC_ALL_MASK, "C", nullptr);
-    return strtod_l(text, nullptr, cLocale);
 }
 
 }  // namespace
@@ -88,7 +82,8 @@ void EnvInt::DoLoad() {
 
 void EnvFloat::DoLoad() {
     OxStringT<char> text;
-    if (Load(text)) m_Value.store(ParseDouble(text), std::memory_order_relaxed);
+    if (Load(text))
+        m_Value.store(strtod_l(text, nullptr, Platform::CLocale()), std::memory_order_relaxed);
 }
 
 bool EnvString::Get(OxStringT<char>& value) {

@@ -26,8 +26,10 @@ KORVEL_EXPORT extern std::atomic<EnvCallback> g_EnvCallback;
 //
 // A setting that has lost its variable keeps its last value, and IsSet becomes false.
 //
-// Threads: reading needs no lock. Two threads may load a setting at once, which is harmless but for
-// EnvString: one that is read while it may be reloading wants a lock of the readers'.
+// Threads: reading needs no lock, but for an EnvString that may be reloading meanwhile, which wants
+// a
+//          lock of the readers'. Two threads may load a setting at once; if the environment changes
+//          just then, the older value may stand until the next change.
 class KORVEL_EXPORT EnvVar {
 public:
     EnvVar(const char* name, bool reload);

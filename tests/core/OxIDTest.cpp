@@ -114,12 +114,25 @@ TEST(OxID, EditsItselfOutOfItsOwnText) {
     id.PrintF("<%s>", static_cast<const char*>(id));
     EXPECT_STREQ(id, "<abab-abab>");
     id.Set(id, 3ul);
-    id = id;  // NOLINT: the rule under test
+    id = id;                            // NOLINT: the rule under test
+    id = static_cast<const char*>(id);  // lies in the cell that the assignment drops
     id += '!';
     id += nullptr;
     EXPECT_STREQ("(" + id + ")", "(<ab!)");
     id.PrintF("%0*d", 10000, 1);
     EXPECT_EQ(id.GetLength(), 10000);
+}
+
+// Inside of a text byte 0xFF is harmless; at the head of one it would make it a cell.
+TEST(OxID, TheMarkerNeverComesToTheHead) {
+    OxID id("x.\xFFy", true);
+    OxID formatted;
+    formatted.PrintF("%s", static_cast<const char*>(id) + 2);
+    OxID grown("", true);
+    grown += '\xFF';
+    EXPECT_STREQ(id.Mid(2), "?y");
+    EXPECT_STREQ(formatted, "?y");
+    EXPECT_STREQ(grown, "?");
 }
 
 TEST(OxID, HoldersOnManyThreadsShareACell) {

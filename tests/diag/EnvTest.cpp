@@ -7,6 +7,7 @@
 #include <thread>
 
 #include "Platform/Processes.h"
+#include "Support.h"
 
 namespace Korvel {
 namespace {
@@ -90,9 +91,13 @@ TEST_F(Setting, ParsesEachType) {
     EXPECT_EQ((Read<EnvFloat, double>(7, {"KORVEL_Test=1.5e3x"})), 1500);
 }
 
-// Where the machine has a locale that writes a comma, a point is the decimal sign all the same.
+// In a locale that writes a comma, a point is the decimal sign all the same.
 TEST_F(Setting, FloatsIgnoreTheLocale) {
-    setlocale(LC_ALL, "de_DE.UTF-8");
+    Korvel::Test::TempDir locales;
+    Korvel::Test::RunProcess({"localedef", "-i", "de_DE", "-f", "UTF-8", locales.Path("german")});
+    setenv("LOCPATH", locales.Path("").c_str(), 1);
+    ASSERT_TRUE(setlocale(LC_ALL, "german")) << "localedef needs the package 'locales'";
+    ASSERT_EQ(strtod("2,5", nullptr), 2.5);
     EXPECT_EQ((Read<EnvFloat, double>(7, {"KORVEL_Test=2.5"})), 2.5);
     EXPECT_EQ((Read<EnvFloat, double>(7, {"KORVEL_Test=2,5"})), 2);
     setlocale(LC_ALL, "C");

@@ -10,6 +10,12 @@ trap 'rm -rf "$place"' EXIT
 quietly() { "$@" >"$place/log" 2>&1 || { cat "$place/log"; exit 1; }; }
 
 quietly "$cmake" --install "$build" --prefix "$place/installed"
+# No installed header needs one that is not.
+(cd "$place/installed/include/korvelscript" && find . -name '*.h' -printf '#include "%P"\n') \
+    >"$place/headers.cpp"
+quietly "$compiler" -std=c++20 -fsyntax-only -I"$place/installed/include/korvelscript" \
+    "$place/headers.cpp"
+
 printf 'assert(arg[1] == "word" and orv.getpid() > 0)\nreturn 7\n' >"$place/script.lua"
 
 check() {

@@ -37,6 +37,8 @@ TEST_F(Oxscript, GivesTheScriptsResultAsItsStatus) {
                           {"return -1", 255},
                           {"os.exit(3)", 3},
                           {"os.exit()", 0},
+                          {"coroutine.wrap(function() os.exit(4) end)()", 4},
+                          {"setmetatable(_G, {__index = error, __newindex = error}) os.exit(5)", 5},
                           {"os.exit(300)", 255},
                           {"return arg.n", 2}};
     for (const Case& c : cases) {

@@ -8,6 +8,7 @@
 #include <cstring>
 #include <lua.hpp>
 
+#include "Platform/Lock.h"
 #include "Platform/Time.h"
 
 extern "C" int luaopen_lpeg(lua_State* L);
@@ -16,6 +17,8 @@ namespace Korvel {
 namespace {
 
 constexpr char kVersion[] = "18.0";
+
+KorvelScript::Lock s_CloseLock;  // held while an interpreter is closed
 
 // The longest wait that a number of milliseconds can ask for.
 constexpr double kMaxWaitMs = 4294967295.0;
@@ -45,6 +48,14 @@ int gettime(lua_State* L) {
     return 1;
 }
 
+// Sets a global to the value on top of the stack, whatever a script has done to the globals'
+// metatable.
+void SetGlobalRaw(lua_State* L, const char* name) {
+    lua_pushstring(L, name);
+    lua_insert(L, -2);
+    lua_rawset(L, LUA_GLOBALSINDEX);
+}
+
 // os.exit: leaves the code and the data in two globals and ends the script with an empty error. The
 // process is the host's to end.
 int myexit(lua_State* L) {
@@ -53,9 +64,9 @@ int myexit(lua_State* L) {
         lua_pushnil(L);
         lua_replace(L, 2);
     }
-    lua_setglobal(L, "_EXITDATA");
+    SetGlobalRaw(L, "_EXITDATA");
     lua_pushnumber(L, lua_type(L, 1) == LUA_TNUMBER ? lua_tonumber(L, 1) : 0);
-    lua_setglobal(L, "_EXITCODE");
+    SetGlobalRaw(L, "_EXITCODE");
     lua_settop(L, 0);
     lua_pushliteral(L, "");
     return lua_error(L);
@@ -66,16 +77,22 @@ constexpr luaL_Reg kFunctions[] = {
     {"gettime", gettime}, {"exit", myexit}, {nullptr, nullptr},
 };
 
-// Opens the library under its second name: a table of its own with the same functions, so that a
-// script that adds to one does not change the other.
-void OpenCopy(lua_State* L, const char* name, int original) {
+void SetVersion(lua_State* L, int library) {
+    lua_pushliteral(L, "_VERSION");
+    lua_pushstring(L, kVersion);
+    lua_rawset(L, library);
+}
+
+// Opens the library under its second name: a table of its own with the very functions of the first.
+void OpenTwin(lua_State* L, const char* name, int original) {
     constexpr luaL_Reg kNothing[] = {{nullptr, nullptr}};
     luaL_register(L, name, kNothing);
-    for (lua_pushnil(L); lua_next(L, original) != 0;) {
-        lua_pushvalue(L, -2);
-        lua_insert(L, -2);
-        lua_rawset(L, -4);
+    int twin = lua_gettop(L);
+    for (const luaL_Reg* function = kFunctions; function->name; function++) {
+        lua_getfield(L, original, function->name);
+        lua_setfield(L, twin, function->name);
     }
+    SetVersion(L, twin);
 }
 
 }  // namespace
@@ -103,6 +120,12 @@ void OpenAllLibs(lua_State* L, TagList*) {
 
 void CloseAllLibs(lua_State*, TagList*) {}
 
+void CloseInterpreter(lua_State* L) {
+    CloseAllLibs(L);
+    KorvelScript::AutoLock guard(s_CloseLock);
+    lua_close(L);
+}
+
 void SetArgs(lua_State* L, char** argv, int first) {
     lua_newtable(L);
     int next = first;
@@ -126,9 +149,8 @@ void SetArgs(lua_State* L, char** argv, int first) {
 extern "C" int luaopen_krscript(lua_State* L) {
     luaL_register(L, "orv", Korvel::kFunctions);
     int orv = lua_gettop(L);
-    lua_pushstring(L, Korvel::kVersion);
-    lua_setfield(L, orv, "_VERSION");
-    Korvel::OpenCopy(L, "ondry", orv);
+    Korvel::SetVersion(L, orv);
+    Korvel::OpenTwin(L, "ondry", orv);
     lua_getglobal(L, "os");
     if (lua_istable(L, -1)) {
         lua_getfield(L, orv, "exit");

@@ -25,6 +25,10 @@ KORVEL_EXPORT void OpenAllLibs(lua_State* L, TagList* tags = nullptr);
 // The counterpart of OpenAllLibs; there is nothing to do.
 KORVEL_EXPORT void CloseAllLibs(lua_State* L, TagList* tags = nullptr);
 
+// Closes an interpreter with all that it holds, one at a time in the process. What it loaded may
+// not be safe to unload side by side.
+KORVEL_EXPORT void CloseInterpreter(lua_State* L);
+
 // Calls the Lua global `require` with a name and, with `setGlobal`, stores the result as the global
 // of that name. A failure is dropped; the global is then not set.
 KORVEL_EXPORT void require(lua_State* L, const char* name, bool setGlobal);

@@ -73,7 +73,7 @@ int RunScriptWith(const char* file, char** argv, lua_CFunction handler) {
     }
     ScriptRun run{file, argv, handler, kFailed};
     if (lua_cpcall(L, LoadAndCall, &run) != 0) WriteLine(MessageAt(L, -1));
-    lua_close(L);
+    CloseInterpreter(L);
     return run.m_Result;
 }
 

@@ -2,6 +2,7 @@
 #include <getopt.h>
 
 #include <cstdio>
+#include <cstring>
 #include <lua.hpp>
 
 #include "runtime/lua/RunScript.h"
@@ -27,10 +28,15 @@ constexpr char kHelp[] =
 bool s_HasExited = false;
 double s_ExitCode = 0;
 
-// os.exit ends a script with an empty error and a number in the global _EXITCODE.
+// os.exit ends a script with an empty error and a number in the global _EXITCODE. On its way
+// through a coroutine or another `error` the empty message may have got a position in front.
 bool TakeExit(lua_State* L) {
-    if (lua_type(L, 1) != LUA_TSTRING || lua_objlen(L, 1) != 0) return false;
-    lua_getglobal(L, "_EXITCODE");
+    if (lua_type(L, 1) != LUA_TSTRING) return false;
+    size_t length;
+    const char* message = lua_tolstring(L, 1, &length);
+    if (length && (length < 2 || strcmp(message + length - 2, ": ") != 0)) return false;
+    lua_pushliteral(L, "_EXITCODE");
+    lua_rawget(L, LUA_GLOBALSINDEX);
     s_HasExited = lua_type(L, -1) == LUA_TNUMBER;
     s_ExitCode = lua_tonumber(L, -1);
     lua_pop(L, 1);
