@@ -94,9 +94,10 @@ TEST_F(Setting, ParsesEachType) {
 // In a locale that writes a comma, a point is the decimal sign all the same.
 TEST_F(Setting, FloatsIgnoreTheLocale) {
     Korvel::Test::TempDir locales;
-    Korvel::Test::RunProcess({"localedef", "-i", "de_DE", "-f", "UTF-8", locales.Path("german")});
-    setenv("LOCPATH", locales.Path("").c_str(), 1);
-    ASSERT_TRUE(setlocale(LC_ALL, "german")) << "localedef needs the package 'locales'";
+    Korvel::Test::RunProcess(
+        {"localedef", "-i", "de_DE", "-f", "UTF-8", locales.Path("de_DE.UTF-8")});
+    setenv("LOCPATH", locales.Path(".").c_str(), 1);
+    ASSERT_TRUE(setlocale(LC_ALL, "de_DE.UTF-8")) << "localedef needs the package 'locales'";
     ASSERT_EQ(strtod("2,5", nullptr), 2.5);
     EXPECT_EQ((Read<EnvFloat, double>(7, {"KORVEL_Test=2.5"})), 2.5);
     EXPECT_EQ((Read<EnvFloat, double>(7, {"KORVEL_Test=2,5"})), 2);
