@@ -31,6 +31,8 @@ private:
 // Ownership: the destructor leaves nodes that are still queued alone.
 // Threads:   Put, Get and Wait from any thread. The lock is held for the list operation and for the
 //            signal, never during a wait, and inside of Put and Get a thread cannot be killed.
+// Failure:   a queue that finds no memory for its lock guards nothing, and one without an event
+//            (GetEvent is null) never lets a waiter through.
 class KORVEL_EXPORT EventQueue : public MinListT<QueueNode>, public Lock, public Event {
 public:
     // Takes over the node and signals. Null is ignored.

@@ -37,7 +37,8 @@ inline long FutexRequeue(FutexWord& from, uint32_t seen, FutexWord& to, long cou
     return syscall(SYS_futex, &from, FUTEX_CMP_REQUEUE_PRIVATE, 0, count, &to, seen);
 }
 
-// A mutex on one futex word. Its waiters cannot be killed, so it is held under NoKill and shortly.
+// A mutex on one futex word. It is taken and let go under NoKill; what holds it for longer, and
+// what waits for it without a NoKill of its own, is up to its users.
 class FutexLock {
 public:
     bool TryObtain() {
@@ -50,10 +51,13 @@ public:
     // For a thread that others may follow in the queue of the word, such as one that has slept
     // there.
     void ObtainAmongWaiters() {
-        while (m_Word.exchange(kHeldWithWaiters, std::memory_order_acquire) != kFree) {
-            FutexWait(m_Word, kHeldWithWaiters);
-        }
+        while (!TryObtainAmongWaiters()) AwaitRelease();
     }
+    // The two steps of the same. Nothing happens to the lock while a thread awaits.
+    bool TryObtainAmongWaiters() {
+        return m_Word.exchange(kHeldWithWaiters, std::memory_order_acquire) == kFree;
+    }
+    void AwaitRelease() { FutexWait(m_Word, kHeldWithWaiters); }
 
     // Moves sleepers of another word here; whoever holds the lock calls it. They run one by one, as
     // the lock gets free, and not before.

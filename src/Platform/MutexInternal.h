@@ -1,14 +1,17 @@
 #pragma once
 
-#include <pthread.h>
-
+#include "Platform/FutexInternal.h"
 #include "Platform/Mutex.h"
 #include "core/0ReusePool.h"
 
 namespace Korvel::Platform {
 
 struct _Mutex : Reuser {
-    pthread_mutex_t m_Mutex = PTHREAD_RECURSIVE_MUTEX_INITIALIZER_NP;
+    FutexLock m_Lock;
+
+    // Written by the holder alone. The owner is a number that no other thread ever has, 0 for none.
+    std::atomic<uint64_t> m_Owner{0};
+    uint32_t m_Depth = 0;
 };
 
 // ObtainMutex for a caller that is inside of one NoKill guard and stays there while it holds the

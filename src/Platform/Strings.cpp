@@ -250,18 +250,22 @@ int UCS4ToWChar(const char32_t* in, wchar_t* out, int size) {
 }
 
 int UTF16ToUTF8(const unsigned short* in, char* out, int size) {
+    NoKill noKill;
     return t_UTF16ToUTF8.Convert(in, out, size, 3);
 }
 
 int UTF8ToUTF16(const char* in, unsigned short* out, int size) {
+    NoKill noKill;
     return t_UTF8ToUTF16.Convert(in, out, size, 1);
 }
 
 int WCharToUTF16(const wchar_t* in, unsigned short* out, int size) {
+    NoKill noKill;
     return t_WCharToUTF16.Convert(in, out, size, 2);
 }
 
 int UTF16ToWChar(const unsigned short* in, wchar_t* out, int size) {
+    NoKill noKill;
     return t_UTF16ToWChar.Convert(in, out, size, 1);
 }
 

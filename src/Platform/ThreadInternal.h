@@ -50,10 +50,13 @@ struct _Thread : Reuser {
     // The futex words, at most two, one of which the thread sleeps on where a kill may end it.
     std::atomic<const void*> m_SleepsOn[2]{};
 
+    std::atomic<bool> m_HasSignal{false};  // a kill signal is on its way to the thread
+
     // Held, under NoKill, by whoever joins the thread or uses m_OSThread: after the join there must
-    // be no call on that handle any more.
+    // be no call on that handle any more. Whoever joins says so, for he may hold it for a while.
     std::mutex m_JoinMutex;
-    std::atomic<bool> m_IsJoined{false};  // written under m_JoinMutex
+    std::atomic<bool> m_IsBeingJoined{false};  // written under m_JoinMutex
+    std::atomic<bool> m_IsJoined{false};       // written under m_JoinMutex
 };
 
 // The calling thread's record; null as long as a thread that is not ours has not been adopted.

@@ -24,6 +24,7 @@
 #include "Platform/ThreadInternal.h"
 #include "Platform/Time.h"
 #include "core/ReusePoolInternal.h"
+#include "core/SpinLock.h"
 
 #if defined(__x86_64__) || defined(__i386__)
 #include <xmmintrin.h>
@@ -109,7 +110,9 @@ void EndBody(_Thread* self) {
 }
 
 void OnKillSignal(int) {
-    if (t_NoKillDepth || !t_ThisThread) return;
+    if (!t_ThisThread) return;
+    t_ThisThread->m_HasSignal = false;
+    if (t_NoKillDepth) return;
     ThreadFate expected = ThreadFate::KillAsked;
     if (t_ThisThread->m_Fate.compare_exchange_strong(expected, ThreadFate::Killed)) LeaveThread();
 }
@@ -133,6 +136,29 @@ void UnblockKillSignal() {
     sigemptyset(&set);
     sigaddset(&set, KillSignal());
     pthread_sigmask(SIG_UNBLOCK, &set, nullptr);
+}
+
+// Holds m_JoinMutex for a join.
+class Joining {
+public:
+    explicit Joining(_Thread& thread) : m_Thread(thread), m_Lock(thread.m_JoinMutex) {
+        m_Thread.m_IsBeingJoined = true;
+    }
+    ~Joining() { m_Thread.m_IsBeingJoined = false; }
+
+private:
+    _Thread& m_Thread;
+    std::lock_guard<std::mutex> m_Lock;
+};
+
+// Holds m_JoinMutex for a call on m_OSThread, unless the thread has been joined or somebody is at
+// it: it may take the thread's exit handlers, and those may ask for the same.
+std::unique_lock<std::mutex> LockOSThread(_Thread& thread) {
+    std::unique_lock lock(thread.m_JoinMutex, std::defer_lock);
+    SpinWait wait;
+    while (!thread.m_IsBeingJoined && !lock.try_lock()) wait.Step();
+    if (lock && (thread.m_IsJoined || thread.m_Kind == ThreadKind::Bare)) lock.unlock();
+    return lock;
 }
 
 void JoinLocked(_Thread& thread) {
@@ -165,7 +191,8 @@ bool EndAndJoinLocked(_Thread& thread) {
     }
     unsigned long long limit = GetTimeCount() + kKillLimitNs;
     do {
-        pthread_kill(thread.m_OSThread, KillSignal());
+        // One at a time: signals that a thread does not take would fill the system's queue.
+        if (!thread.m_HasSignal.exchange(true)) pthread_kill(thread.m_OSThread, KillSignal());
         if (JoinForAMomentLocked(thread)) return true;
     } while (GetTimeCount() < limit);
 
@@ -317,6 +344,7 @@ bool SuspendThread(_Thread*) {
 }
 
 bool WaitThread(_Thread* thread, unsigned int timeoutMs) {
+    if (thread->m_IsJoined) return true;
     if (thread->m_QuitEvent && !WaitEvent(thread->m_QuitEvent, timeoutMs)) return false;
     if (thread->m_Kind == ThreadKind::Adopted) {
         // It may go on for ever, so this is no place for the guard or the mutex. Its record goes
@@ -324,7 +352,7 @@ bool WaitThread(_Thread* thread, unsigned int timeoutMs) {
         pthread_join(thread->m_OSThread, nullptr);
     } else if (thread->m_Kind == ThreadKind::Made) {
         NoKill noKill;
-        std::lock_guard lock(thread->m_JoinMutex);
+        Joining joining(*thread);
         JoinLocked(*thread);
     }
     return true;
@@ -336,11 +364,8 @@ bool HasThreadQuit(_Thread* thread) {
         return tgkill(getpid(), static_cast<pid_t>(thread->m_ID), 0) != 0;
     }
     NoKill noKill;
-    std::unique_lock lock(thread->m_JoinMutex, std::try_to_lock);
-    if (!lock) return false;  // somebody is joining it, so it is not over yet
-    if (!thread->m_IsJoined && pthread_tryjoin_np(thread->m_OSThread, nullptr) == 0) {
-        thread->m_IsJoined = true;
-    }
+    std::unique_lock lock = LockOSThread(*thread);
+    if (lock && pthread_tryjoin_np(thread->m_OSThread, nullptr) == 0) thread->m_IsJoined = true;
     return thread->m_IsJoined;
 }
 
@@ -366,7 +391,7 @@ bool KillThread(_Thread* thread, unsigned int) {
     NoKill noKill;
     bool isOurs;
     {
-        std::lock_guard lock(thread->m_JoinMutex);
+        Joining joining(*thread);
         if (!thread->m_IsJoined && !EndAndJoinLocked(*thread)) return false;
         isOurs = thread->m_Fate.exchange(ThreadFate::Ended) == ThreadFate::Killed;
         if (isOurs) {
@@ -434,20 +459,16 @@ void InitThread() {
 void SetThreadPriority(_Thread* thread, ThreadPri priority) {
     if (priority > 6) return;
     NoKill noKill;
-    std::lock_guard lock(thread->m_JoinMutex);
-    if (thread->m_Kind != ThreadKind::Bare && !thread->m_IsJoined) {
-        SetPriority(thread->m_OSThread, priority);
-    }
+    if (std::unique_lock lock = LockOSThread(*thread)) SetPriority(thread->m_OSThread, priority);
 }
 
 ThreadPri GetThreadPriority(_Thread* thread) {
     NoKill noKill;
-    std::lock_guard lock(thread->m_JoinMutex);
+    std::unique_lock lock = LockOSThread(*thread);
     int policy;
     sched_param param;
     int lowest, highest;
-    if (thread->m_Kind == ThreadKind::Bare || thread->m_IsJoined ||
-        pthread_getschedparam(thread->m_OSThread, &policy, &param) != 0 ||
+    if (!lock || pthread_getschedparam(thread->m_OSThread, &policy, &param) != 0 ||
         !GetPriorityLimits(policy, lowest, highest)) {
         return kDefaultThreadPri;
     }

@@ -40,9 +40,11 @@ KORVEL_EXPORT bool ResumeThread(_Thread* thread);
 // Has no effect on a thread that runs. Always true.
 KORVEL_EXPORT bool SuspendThread(_Thread* thread);
 
-// Waits for the end of the body and for the thread to be gone.
+// Waits for the end of the body and for the thread to be gone. An adopted thread has no end of a
+// body to wait for: it is joined, however long that takes, so nobody else may join it.
 //   timeoutMs  0 only looks, 0xFFFFFFFF has no limit
-//   returns    false when the body has not ended in time
+//   returns    false when the body has not ended in time; with 0 perhaps also while another thread
+//              looks at the same moment
 KORVEL_EXPORT bool WaitThread(_Thread* thread, unsigned int timeoutMs);
 
 // True once the thread is gone, a little later than the end of its body.
@@ -77,7 +79,8 @@ KORVEL_EXPORT unsigned long long GetCurrentThreadID();
 // the thread. Null when memory has run out or the thread is past its body.
 KORVEL_EXPORT _Thread* GetCurrentThread();
 
-// Gives the calling thread a record and an id, unless it has them.
+// Gives the calling thread a record and an id, unless it has a record. Not for exit handlers of
+// threads: nobody would drop the record.
 KORVEL_EXPORT void _SetCurrentThread();
 
 // Sets the calling thread's locale and number handling as NewThread does, for threads of the host.

@@ -114,7 +114,7 @@ struct PoolAccess {
     static void* AllocSlow(unsigned long size);
     static void Free(void* p);
     static void FreeSlow(Block* block);
-    static void* NewBlock(unsigned long size);
+    static Block* NewBlock(unsigned long size);
 
     static uint32_t LockClass(unsigned k);
     static void UnlockClass(unsigned k, uint32_t count);
@@ -317,10 +317,15 @@ void* PoolAccess::AllocSlow(unsigned long size) {
     Platform::NoKill noKill;
     Faults::Uncounted uncounted;
     Magazine* magazine = CurrentMagazine();
-    if (size - 1 >= MaxSize()) return NewBlock(size);
-    unsigned k = ClassOf(size);
-    Block* block = magazine && k < kRackCount ? magazine->Take(k) : TakeOne(k);
-    return block ? HandOut(block, size, SizeOf(k)) : NewBlock(SizeOf(k));
+    unsigned long rounded = size;
+    Block* block = nullptr;
+    if (size - 1 < MaxSize()) {
+        unsigned k = ClassOf(size);
+        rounded = SizeOf(k);
+        block = magazine && k < kRackCount ? magazine->Take(k) : TakeOne(k);
+    }
+    if (!block) block = NewBlock(rounded);
+    return block ? HandOut(block, size, rounded) : nullptr;
 }
 
 void PoolAccess::FreeSlow(Block* block) {
@@ -342,12 +347,12 @@ void PoolAccess::FreeSlow(Block* block) {
     }
 }
 
-void* PoolAccess::NewBlock(unsigned long size) {
+PoolAccess::Block* PoolAccess::NewBlock(unsigned long size) {
     if (size > SIZE_MAX - kHeaderSize) return nullptr;
     Block* block = static_cast<Block*>(malloc(size + kHeaderSize));
     if (!block) return nullptr;
     block->m_Size = size;
-    return block + 1;
+    return block;
 }
 
 uint32_t PoolAccess::LockClass(unsigned k) {

@@ -626,24 +626,23 @@ void OxStringT<T>::Delete(int position, int length) {
 // Keeps the first `kept` units and puts the formatted text in the place of the rest.
 template <class T>
 void OxStringT<T>::Format(unsigned long kept, const T* format, va_list args) {
-    if (!format) return Empty();
+    if (!format || std::same_as<T, char32_t>) return Empty();
     va_list again;
     va_copy(again, args);
-    T scratch[kFormatScratch];
-    int length = FormatUnits(scratch, kFormatScratch, format, args);
-    unsigned long total = kept + static_cast<unsigned long>(std::max(length, 0));
-    if (length < 0) {
-        Empty();
-    } else if (length < kFormatScratch) {
-        Splice(kept, Length() - kept, scratch, static_cast<unsigned long>(length));
+    T scratch[kFormatScratch] = {};
+    unsigned long length =
+        static_cast<unsigned long>(std::max(FormatUnits(scratch, kFormatScratch, format, args), 0));
+    // A NUL that is formatted as a character ends the text: no string holds one.
+    if (length < kFormatScratch) {
+        Splice(kept, Length() - kept, scratch, Units::Length(scratch, length));
     } else {
         // The arguments may be read out of the present buffer, so it must not be written.
-        T* buffer = NewBuffer(total);
+        T* buffer = NewBuffer(kept + length);
         if (buffer) {
             Copy(buffer, m_Text, kept);
-            FormatUnits(buffer + kept, length + 1, format, again);
+            FormatUnits(buffer + kept, static_cast<int>(length) + 1, format, again);
         }
-        Adopt(buffer, total);
+        Adopt(buffer, buffer ? kept + Units::Length(buffer + kept, length) : 0);
     }
     va_end(again);
 }

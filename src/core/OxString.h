@@ -279,8 +279,8 @@ public:
     void Delete(int position, int length);  // negative length: to the end
 
     // Formatting, as printf (wprintf, which stops at 32,768 units) has it: PrintF replaces the text
-    // and CatF adds to it. A null format makes the string empty. There is no formatting for
-    // char32_t; the string becomes empty.
+    // and CatF adds to it; what cannot be formatted counts as empty text. A null format makes the
+    // string empty. There is no formatting for char32_t; the string becomes empty.
 
     void PrintF(const T* format, ...);
     void PrintFArgs(const T* format, va_list args);

@@ -2,7 +2,10 @@
 
 #include <strings.h>
 
+#include <algorithm>
 #include <cctype>
+#include <climits>
+#include <cstdint>
 #include <cstdlib>
 #include <cstring>
 #include <cwchar>
@@ -116,7 +119,10 @@ inline int CompareNoCase(const char32_t* a, const char32_t* b, size_t most) {
     for (; most > 0; most--, a++, b++) {
         char32_t left = FoldAsciiCase(*a);
         char32_t right = FoldAsciiCase(*b);
-        if (left != right) return left < right ? -1 : 1;
+        if (left != right) {
+            int64_t difference = int64_t{left} - int64_t{right};
+            return static_cast<int>(std::clamp<int64_t>(difference, -INT_MAX, INT_MAX));
+        }
         if (!left) break;
     }
     return 0;
