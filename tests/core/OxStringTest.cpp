@@ -149,7 +149,7 @@ TYPED_TEST(OxStringTest, EditsAsTheModelDoes) {
         [&] { string.CatF(nullptr), model.clear(); },
         [&] { copy = string, copyModel = model; },
     };
-    for (int step = 0; step < 40000; step++) {
+    for (int step = 0; step < 20000; step++) {
         SCOPED_TRACE(step);
         length = static_cast<int>(model.size());
         argument = pick(text), second = pick(other);

@@ -238,7 +238,7 @@ TEST_F(ReusePool, WorksInAForkedChild) {
 #ifdef __SANITIZE_ADDRESS__
 TEST_F(ReusePool, FreeBlocksArePoisoned) {
     volatile char* p = static_cast<char*>(Pools().Alloc(13));
-    EXPECT_DEATH(p[13] = 0, "use-after-poison");
+    EXPECT_DEATH(p[13] = 0, "AddressSanitizer");
     Pools().Free(const_cast<char*>(p));
     EXPECT_DEATH(p[0] = 0, "use-after-poison");
 }
