@@ -89,7 +89,9 @@ thread_local AdoptedThread t_Adopted;
 void RefreshIDAfterFork() {
     if (!t_ThisThreadID) return;
     t_ThisThreadID = AskForID();
-    if (t_ThisThread) t_ThisThread->m_ID = t_ThisThreadID;
+    if (!t_ThisThread) return;
+    t_ThisThread->m_ID = t_ThisThreadID;
+    t_ThisThread->m_Fate = ThreadFate::Running;  // who kills the parent's thread is not here
 }
 
 [[maybe_unused]] const int s_ForkHook = pthread_atfork(nullptr, nullptr, RefreshIDAfterFork);
@@ -112,9 +114,8 @@ void EndBody(_Thread* self) {
 void OnKillSignal(int) {
     if (!t_ThisThread) return;
     t_ThisThread->m_HasSignal = false;
-    if (t_NoKillDepth) return;
-    ThreadFate expected = ThreadFate::KillAsked;
-    if (t_ThisThread->m_Fate.compare_exchange_strong(expected, ThreadFate::Killed)) LeaveThread();
+    t_IsKillDue = true;
+    if (t_NoKillDepth == 0) TakeDueKill();
 }
 
 // Puts our handler on the kill signal, unless somebody else uses it.
@@ -291,6 +292,13 @@ void SetFloatState() {}
 #endif
 
 }  // namespace
+
+void TakeDueKill() {
+    t_IsKillDue = false;
+    ThreadFate expected = ThreadFate::KillAsked;
+    if (t_ThisThread && t_ThisThread->m_Fate.compare_exchange_strong(expected, ThreadFate::Killed))
+        LeaveThread();
+}
 
 _Thread* CreateThreadStruct(bool withEvent) {
     NoKill noKill;

@@ -271,6 +271,7 @@ void AfterForkInChild() {
     bool hasOwn = t_Magazine != &s_NoMagazine && t_Magazine != &s_GoneMagazine;
     s_Registry = hasOwn ? t_Magazine : nullptr;
     if (hasOwn) t_Magazine->m_Next = t_Magazine->m_Prev = nullptr;
+    Platform::t_IsKillDue = false;  // a kill that comes during the fork is for the parent
     AfterForkInParent();
 }
 
