@@ -36,6 +36,9 @@ target_compile_options(korvel_flags INTERFACE
 if(KORVEL_FAULTS)
     target_compile_definitions(korvel_flags INTERFACE KORVEL_FAULTS=1)
 endif()
+if(KORVEL_FUZZ)
+    target_compile_options(korvel_flags INTERFACE -fsanitize=fuzzer-no-link)
+endif()
 if(KORVEL_SANITIZE)
     target_compile_options(korvel_flags INTERFACE
         -fsanitize=${KORVEL_SANITIZE} -fno-omit-frame-pointer -fno-sanitize-recover=all
