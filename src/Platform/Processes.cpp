@@ -22,7 +22,7 @@ struct ImmortalMutex {
         _Mutex m_Mutex;
     };
     constexpr ImmortalMutex() : m_Mutex() {}
-    ~ImmortalMutex() {}
+    ~ImmortalMutex() {}  // NOLINT(modernize-use-equals-default): that would destroy the member
 };
 constinit ImmortalMutex s_EnvMutex;
 

@@ -77,7 +77,7 @@ constexpr unsigned long SizeOf(unsigned k) {
     return k * 8ul;
 }
 constexpr uint32_t BlockBytes(unsigned k) {
-    return k * 8 + kHeaderSize;
+    return static_cast<uint32_t>(SizeOf(k) + kHeaderSize);
 }
 
 // The most blocks that a rack may hold.
