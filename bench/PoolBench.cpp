@@ -22,12 +22,9 @@ struct Allocator {
 };
 
 std::vector<Allocator> FindAllocators() {
-    std::vector<Allocator> found = {{
-        "pools",
-        Korvel::Reuser::operator new,
-        Korvel::Reuser::operator delete },
-        {"malloc", malloc, free},
-    };
+    void* (*const alloc)(size_t) = Korvel::Reuser::operator new;
+    void (*const release)(void*) = Korvel::Reuser::operator delete;
+    std::vector<Allocator> found = {{"pools", alloc, release}, {"malloc", malloc, free}};
     const char* const peers[][4] = {
         {"mimalloc", "libmimalloc.so.2", "mi_malloc", "mi_free"},
         {"jemalloc", "libjemalloc.so.2", "malloc", "free"},
@@ -36,9 +33,9 @@ std::vector<Allocator> FindAllocators() {
     for (const auto& peer : peers) {
         void* library = dlopen(peer[1], RTLD_NOW | RTLD_LOCAL);
         if (!library) continue;
-        auto alloc = reinterpret_cast<void* (*)(size_t)>(dlsym(library, peer[2]));
-        auto release = reinterpret_cast<void (*)(void*)>(dlsym(library, peer[3]));
-        if (alloc && release) found.push_back({peer[0], alloc, release});
+        auto peerAlloc = reinterpret_cast<void* (*)(size_t)>(dlsym(library, peer[2]));
+        auto peerFree = reinterpret_cast<void (*)(void*)>(dlsym(library, peer[3]));
+        if (peerAlloc && peerFree) found.push_back({peer[0], peerAlloc, peerFree});
     }
     return found;
 }

@@ -13,6 +13,7 @@
 
 #include "Platform/EventsInternal.h"
 #include "Platform/ThreadInternal.h"
+#include "Platform/TimeInternal.h"
 
 namespace Korvel::Platform {
 
@@ -30,17 +31,6 @@ struct _Event : Reuser {
 
 namespace {
 
-timespec DeadlineIn(unsigned int timeoutMs) {
-    timespec time;
-    clock_gettime(CLOCK_REALTIME, &time);
-    constexpr uint64_t kSecond = 1'000'000'000;
-    uint64_t ns = static_cast<uint64_t>(time.tv_sec) * kSecond +
-                  static_cast<uint64_t>(time.tv_nsec) + uint64_t{timeoutMs} * 1'000'000;
-    time.tv_sec = static_cast<time_t>(ns / kSecond);
-    time.tv_nsec = static_cast<long>(ns % kSecond);
-    return time;
-}
-
 // Wakes whom the signal concerns while the lock is held: a waiter must not return, and perhaps
 // delete the event, before we are done with it. A flag that is set already has woken whom it could.
 void SetLocked(_Event& event) {
@@ -56,7 +46,9 @@ void SetLocked(_Event& event) {
 void SleepUntilSet(_Event& event, unsigned int timeoutMs) {
     timespec deadline;
     bool hasLimit = timeoutMs != kNoTimeLimit;
-    if (hasLimit) deadline = DeadlineIn(timeoutMs);
+    if (hasLimit) {
+        deadline = ToTimespec(ReadClock(CLOCK_REALTIME) + uint64_t{timeoutMs} * kMillisecondNs);
+    }
     event.m_WaiterCount++;
     int error = 0;
     while (!event.m_IsSignalled && (error == 0 || error == EAGAIN || error == EINTR)) {

@@ -30,9 +30,8 @@ KORVEL_EXPORT void ResetEvent(_Event* event);
 KORVEL_EXPORT void PulseEvent(_Event* event);
 
 // True when the event was set; that clears an auto-reset event.
-//   timeoutMs  0 never blocks, not even on another thread that has the event in hand at this
-//   moment:
-//              the answer is then false, set or not. The limit is on the wall clock.
+//   timeoutMs  0 never blocks, not even on another thread that has the event in hand just then: the
+//              answer is false, set or not. The limit is on the wall clock.
 KORVEL_EXPORT bool WaitEvent(_Event* event, unsigned int timeoutMs);
 
 // Waits for one event after the other, with the whole time-out for each, and gives up at the first

@@ -18,8 +18,8 @@ static_assert(sizeof(FutexWord) == sizeof(uint32_t) && FutexWord::is_always_lock
 
 // Sleeps if `word` still is `seen`.
 //   deadline  on the wall clock; null has no limit
-//   returns   0 when woken, else the system's error: ETIMEDOUT, EAGAIN (the word had changed),
-//   EINTR
+//   returns   0 when woken, else the system's error: ETIMEDOUT, EINTR, or EAGAIN when the word had
+//             changed
 inline int FutexWait(FutexWord& word, uint32_t seen, const timespec* deadline = nullptr) {
     constexpr int kWait = FUTEX_WAIT_BITSET | FUTEX_PRIVATE_FLAG | FUTEX_CLOCK_REALTIME;
     long result = syscall(SYS_futex, &word, kWait, seen, deadline, nullptr, FUTEX_BITSET_MATCH_ANY);

@@ -11,8 +11,7 @@ struct _Mutex;
 // A recursive mutex: its holder may take it again and then has to release it as often.
 //
 // Threads: only the thread that holds a mutex can release it. A thread that is killed while it
-// holds
-//          one holds it for ever; one that is killed while it waits leaves no trace.
+//          holds one holds it for ever; one that is killed while it waits leaves no trace.
 // Failure: a null mutex is never obtained, and to release or delete it does nothing.
 KORVEL_EXPORT _Mutex* NewMutex(bool initialOwner);  // null when memory has run out
 KORVEL_EXPORT void DeleteMutex(_Mutex* mutex);

@@ -5,6 +5,7 @@
 
 #include <cstdlib>
 #include <cstring>
+#include <type_traits>
 
 #include "Platform/Events.h"
 #include "Platform/MutexInternal.h"
@@ -15,16 +16,10 @@
 namespace Korvel::Platform {
 namespace {
 
-// Constant-initialised and never destroyed: other static initialisers, and threads that still run
-// while the process ends, may ask for a setting.
-struct ImmortalMutex {
-    union {
-        _Mutex m_Mutex;
-    };
-    constexpr ImmortalMutex() : m_Mutex() {}
-    ~ImmortalMutex() {}  // NOLINT(modernize-use-equals-default): that would destroy the member
-};
-constinit ImmortalMutex s_EnvMutex;
+// Constant-initialised and with nothing to destroy: other static initialisers, and threads that
+// still run while the process ends, may ask for a setting.
+constinit _Mutex s_EnvMutex;
+static_assert(std::is_trivially_destructible_v<_Mutex>);
 
 // A text that was handed to putenv, which keeps the pointer. The chain is what owns them.
 struct EnvString {
@@ -36,7 +31,7 @@ constinit EnvString* s_EnvStrings = nullptr;  // guarded by the environment lock
 // Holds the environment lock until the end of its scope, and keeps kills away meanwhile.
 class AutoEnvLock {
 public:
-    AutoEnvLock() { ObtainMutexGuarded(s_EnvMutex.m_Mutex, kNoTimeLimit); }
+    AutoEnvLock() { ObtainMutexGuarded(s_EnvMutex, kNoTimeLimit); }
     AutoEnvLock(const AutoEnvLock&) = delete;
     AutoEnvLock& operator=(const AutoEnvLock&) = delete;
     ~AutoEnvLock() { ReleaseEnvLock(); }
@@ -51,10 +46,10 @@ char** GetEnviron() {
     return environ;
 }
 void ObtainEnvLock() {
-    ObtainMutex(&s_EnvMutex.m_Mutex, kNoTimeLimit);
+    ObtainMutex(&s_EnvMutex, kNoTimeLimit);
 }
 void ReleaseEnvLock() {
-    ReleaseMutex(&s_EnvMutex.m_Mutex);
+    ReleaseMutex(&s_EnvMutex);
 }
 
 bool GetEnv(const char* name, OxStringT<char>& value) {

@@ -23,6 +23,7 @@
 #include "Platform/Platform.h"
 #include "Platform/ThreadInternal.h"
 #include "Platform/Time.h"
+#include "Platform/TimeInternal.h"
 #include "core/ReusePoolInternal.h"
 #include "core/SpinLock.h"
 
@@ -41,8 +42,8 @@ constexpr uint32_t kGateStarting = 0;  // NewThread waits for the id
 constexpr uint32_t kGateHeld = 1;      // the body waits for ResumeThread
 constexpr uint32_t kGateOpen = 2;
 
-constexpr long kKillStepNs = 1'000'000;  // from one signal to the next
-constexpr unsigned long long kKillLimitNs = 1'000'000'000;
+constexpr uint64_t kKillStepNs = kMillisecondNs;  // from one signal to the next
+constexpr uint64_t kKillLimitNs = kSecondNs;
 
 constexpr size_t kMaxNameBytes = 15;  // the system's limit
 
@@ -91,7 +92,9 @@ void RefreshIDAfterFork() {
     t_ThisThreadID = AskForID();
     if (!t_ThisThread) return;
     t_ThisThread->m_ID = t_ThisThreadID;
-    t_ThisThread->m_Fate = ThreadFate::Running;  // who kills the parent's thread is not here
+    // Who kills the parent's thread is not here, and neither is his signal.
+    t_ThisThread->m_Fate = ThreadFate::Running;
+    t_ThisThread->m_HasSignal = false;
 }
 
 [[maybe_unused]] const int s_ForkHook = pthread_atfork(nullptr, nullptr, RefreshIDAfterFork);
@@ -169,13 +172,7 @@ void JoinLocked(_Thread& thread) {
 }
 
 bool JoinForAMomentLocked(_Thread& thread) {
-    timespec until;
-    clock_gettime(CLOCK_MONOTONIC, &until);
-    until.tv_nsec += kKillStepNs;
-    if (until.tv_nsec >= 1'000'000'000) {
-        until.tv_nsec -= 1'000'000'000;
-        until.tv_sec++;
-    }
+    timespec until = ToTimespec(ReadClock(CLOCK_MONOTONIC) + kKillStepNs);
     if (pthread_clockjoin_np(thread.m_OSThread, nullptr, CLOCK_MONOTONIC, &until) != 0)
         return false;
     thread.m_IsJoined = true;
@@ -190,12 +187,12 @@ bool EndAndJoinLocked(_Thread& thread) {
         JoinLocked(thread);  // the body has ended by itself
         return true;
     }
-    unsigned long long limit = GetTimeCount() + kKillLimitNs;
+    uint64_t limit = ReadClock(CLOCK_MONOTONIC) + kKillLimitNs;
     do {
         // One at a time: signals that a thread does not take would fill the system's queue.
         if (!thread.m_HasSignal.exchange(true)) pthread_kill(thread.m_OSThread, KillSignal());
         if (JoinForAMomentLocked(thread)) return true;
-    } while (GetTimeCount() < limit);
+    } while (ReadClock(CLOCK_MONOTONIC) < limit);
 
     expected = ThreadFate::KillAsked;
     if (thread.m_Fate.compare_exchange_strong(expected, ThreadFate::Running)) return false;

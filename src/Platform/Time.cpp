@@ -2,37 +2,30 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <ctime>
+
+#include "Platform/TimeInternal.h"
 
 namespace Korvel::Platform {
 
 namespace {
 
 constexpr unsigned long long kLongestWaitMs = 4294967;  // 32 bits of microseconds
-constexpr unsigned long long kSecondNs = 1'000'000'000;
 
 }  // namespace
 
 unsigned long long GetUpTime() {
-    timespec time;
-    clock_gettime(CLOCK_REALTIME, &time);
-    return static_cast<unsigned long long>(time.tv_sec) * 1000 +
-           static_cast<unsigned long long>(time.tv_nsec) / 1'000'000;
+    return ReadClock(CLOCK_REALTIME) / kMillisecondNs;
 }
 
 void Wait(unsigned long long ms) {
     // Up to a point in time, so that signals do not stretch the sleep.
-    unsigned long long until = GetTimeCount() + std::min(ms, kLongestWaitMs) * 1'000'000;
-    timespec time{static_cast<time_t>(until / kSecondNs), static_cast<long>(until % kSecondNs)};
-    while (clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &time, nullptr) == EINTR) {
+    timespec until = ToTimespec(GetTimeCount() + std::min(ms, kLongestWaitMs) * kMillisecondNs);
+    while (clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &until, nullptr) == EINTR) {
     }
 }
 
 unsigned long long GetTimeCount() {
-    timespec time;
-    clock_gettime(CLOCK_MONOTONIC, &time);
-    return static_cast<unsigned long long>(time.tv_sec) * kSecondNs +
-           static_cast<unsigned long long>(time.tv_nsec);
+    return ReadClock(CLOCK_MONOTONIC);
 }
 
 unsigned long long GetTimeFreq() {

@@ -26,10 +26,9 @@ KORVEL_EXPORT extern std::atomic<EnvCallback> g_EnvCallback;
 //
 // A setting that has lost its variable keeps its last value, and IsSet becomes false.
 //
-// Threads: reading needs no lock, but for an EnvString that may be reloading meanwhile, which wants
-// a
-//          lock of the readers'. Two threads may load a setting at once; if the environment changes
-//          just then, the older value may stand until the next change.
+// Threads: reading needs no lock, but for an EnvString that may be reloading: it wants one of the
+//          readers' own. Two threads may load a setting at once; if the environment changes just
+//          then, the older value may stand until the next change.
 class KORVEL_EXPORT EnvVar {
 public:
     EnvVar(const char* name, bool reload);

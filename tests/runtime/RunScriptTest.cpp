@@ -2,6 +2,7 @@
 
 #include <dlfcn.h>
 #include <gtest/gtest.h>
+#include <pthread.h>
 
 #include <lua.hpp>
 
@@ -122,6 +123,30 @@ TEST(SharedLibrary, LoadsLateAndShowsItsEntries) {
     EXPECT_STREQ(lua_tostring(L, -1), "18.0");
     lua_close(L);
     dlclose(library);
+}
+
+// A host may have used up the keys of thread-local values. The pools then work without magazines,
+// and leave the host's keys alone.
+TEST(SharedLibrary, LoadsWhereNoKeyIsLeft) {
+    std::vector<pthread_key_t> keys;
+    for (pthread_key_t key; pthread_key_create(&key, nullptr) == 0;) keys.push_back(key);
+    for (pthread_key_t& key : keys) pthread_setspecific(key, &key);
+    void* library = dlopen(SHARED_LIBRARY, RTLD_NOW | RTLD_LOCAL);
+    ASSERT_NE(library, nullptr) << dlerror();
+    auto run = reinterpret_cast<decltype(&RunScript)>(dlsym(library, "RunScript"));
+    TempDir dir;
+    EXPECT_EQ(run(dir.Write("script.lua", "return 7").c_str(), nullptr), 7);
+    using Alloc = void* (*)(size_t);
+    auto alloc = reinterpret_cast<Alloc>(dlsym(library, "_ZN6Korvel6ReusernwEm"));
+    auto release = reinterpret_cast<void (*)(void*)>(dlsym(library, "_ZN6Korvel6ReuserdlEPv"));
+    ASSERT_TRUE(alloc && release);
+    void* block = alloc(64);
+    release(block);
+    EXPECT_EQ(alloc(64), block);
+    for (pthread_key_t& key : keys) {
+        EXPECT_EQ(pthread_getspecific(key), &key);
+        pthread_key_delete(key);
+    }
 }
 
 }  // namespace
