@@ -26,42 +26,15 @@
 #include "core/ReusePoolInternal.h"
 #include "core/SpinLock.h"
 
-#if defined(__SANITIZE_ADDRESS__)
-#define KORVEL_POISONING 1
-#elif defined(__has_feature)
-#if __has_feature(address_sanitizer)
-#define KORVEL_POISONING 1
-#endif
-#endif
-#ifdef KORVEL_POISONING
-#include <sanitizer/asan_interface.h>
-#endif
-
 namespace Korvel {
 
-struct ReusePoolManager::Block {
-    union {
-        uint64_t m_Size;  // in use: bytes the user may touch
-        Block* m_Next;    // free: the next free block
-    };
-    // On a class list alone. The first block of a batch knows the last one, which knows what is in
-    // between; a block that is a batch by itself has null.
-    union {
-        Block* m_Last;
-        struct {
-            uint32_t m_Length;
-            uint32_t m_Sender;
-        } m_Batch;
-    };
-};
+using namespace Pools;
 
 namespace {
 
 constexpr uint32_t kLocked = 0xFFFFFFFF;
 constexpr uint32_t kNoEpoch = 0xFFFFFFFF;  // the manager's epoch never gets there
 
-constexpr unsigned long kMaxMagazineSize = 1024;
-constexpr unsigned kRackCount = kMaxMagazineSize / 8 + 1;  // by class number; rack 0 stays empty
 constexpr uint32_t kMaxRackBlocks = 64;
 constexpr uint32_t kMaxRackBytes = 16 * 1024;
 constexpr uint32_t kMaxThreadBytes = 256 * 1024;
@@ -70,12 +43,6 @@ constexpr int kBatchesLookedAt = 3;  // for one that the thread has sent itself
 
 constexpr size_t kHeaderSize = 16;
 
-constexpr unsigned ClassOf(unsigned long size) {
-    return static_cast<unsigned>((size + 7) / 8);
-}
-constexpr unsigned long SizeOf(unsigned k) {
-    return k * 8ul;
-}
 constexpr uint32_t BlockBytes(unsigned k) {
     return static_cast<uint32_t>(SizeOf(k) + kHeaderSize);
 }
@@ -91,107 +58,24 @@ constexpr uint32_t TotalRackSize() {
     return total;
 }
 
-using Count = std::atomic<uint32_t>;
-
-uint32_t Get(const Count& count) {
-    return count.load(std::memory_order_relaxed);
-}
-void Set(Count& count, uint32_t value) {
-    count.store(value, std::memory_order_relaxed);
-}
-
-}  // namespace
-
-// The parts of the manager that need its private types: blocks and class lists.
-struct PoolAccess {
-    using Manager = ReusePoolManager;
-    using Block = ReusePoolManager::Block;
-
-    static Manager& Pools() { return g_ReusePoolMgr; }
-    static uint64_t MaxSize() { return Pools().m_MaxSize.load(std::memory_order_relaxed); }
-
-    static void* Alloc(unsigned long size);
-    static void* AllocSlow(unsigned long size);
-    static void Free(void* p);
-    static void FreeSlow(Block* block);
-    static Block* NewBlock(unsigned long size);
-
-    static uint32_t LockClass(unsigned k);
-    static void UnlockClass(unsigned k, uint32_t count);
-    static Block*& List(unsigned k) { return Pools().m_Lists[k - 1]; }
-    static uint32_t ListCount(unsigned k);
-    static bool IsListEmpty(unsigned k);
-    static void PutBatch(unsigned k, Block* first, Block* last, uint32_t length);
-    static Block* TakeOne(unsigned k);
-    static Block* TakeBatch(unsigned k, uint32_t most, uint32_t sender, uint32_t& taken);
-    static void FreeList(unsigned k);
-};
-
-// The free blocks that one thread keeps for itself, up to 1 KiB a block. They keep their size in
-// their header.
-//
-// The owner alone reads and writes it, but for the counts and the epoch, which GetSize reads, and
-// the links, which s_RegistryLock guards. The short path runs without a NoKill guard: a thread that
-// is ended between any two of its stores loses the block at hand and nothing else.
-struct Magazine {
-    using Block = PoolAccess::Block;
-
-    struct Rack {
-        Block** m_Slots = nullptr;  // behind the magazine, RackSize() of them
-        Count m_Count{0};
-        uint32_t m_Limit = 0;  // granted blocks
-    };
-
-    Count m_Epoch{0};
-    uint32_t m_Granted = 0;  // bytes, of all racks
-    uint32_t m_Serial = 0;   // tells its batches from others
-    Magazine* m_Next = nullptr;
-    Magazine* m_Prev = nullptr;
-    Rack m_Racks[kRackCount] = {};  // by class number
-
-    static Magazine* New();
-    bool Grant(unsigned k, uint32_t limit);
-    bool GrantMore(unsigned k);
-    void GrantFirst(unsigned k);
-    Block* Take(unsigned k);
-    void Put(unsigned k, Block* block);
-    void Send(unsigned k, uint32_t count);
-    void Empty();
-};
-
-namespace {
-
-// Raised by FreeAll: what a magazine of an older epoch holds has to go to the system.
-constinit Count s_Epoch{0};
 constinit Count s_NextSerial{1};
 
 // Stand-ins, so that the short path needs no test for null: their epoch never comes.
 constinit Magazine s_NoMagazine{.m_Epoch = kNoEpoch};    // the thread has not allocated yet
 constinit Magazine s_GoneMagazine{.m_Epoch = kNoEpoch};  // the thread is ending, or goes without
 
-constinit thread_local Magazine* t_Magazine __attribute__((tls_model("initial-exec"))) =
-    &s_NoMagazine;
+}  // namespace
+
+constinit Count Pools::g_Epoch{0};
+constinit thread_local Magazine* Pools::t_Magazine = &s_NoMagazine;
+
+namespace {
 
 constinit SpinLock s_RegistryLock;
 constinit Magazine* s_Registry = nullptr;  // all magazines but the stand-ins
 constinit uint32_t s_ForkCounts[ReusePoolManager::kClassCount] = {};
 pthread_key_t s_ExitKey;
 constinit bool s_HasExitKey = false;  // without one, nobody would give back a magazine
-
-void Poison(PoolAccess::Block* block, size_t size) {
-#ifdef KORVEL_POISONING
-    ASAN_POISON_MEMORY_REGION(block + 1, size);
-#endif
-}
-
-// Makes a free block the user's.
-void* HandOut(PoolAccess::Block* block, size_t size, size_t roundedSize) {
-#ifdef KORVEL_POISONING
-    ASAN_UNPOISON_MEMORY_REGION(block + 1, size);
-    ASAN_POISON_MEMORY_REGION(reinterpret_cast<char*>(block + 1) + size, roundedSize - size);
-#endif
-    return block + 1;
-}
 
 // The calling thread's magazine, up to date with the epoch, made if need be; null where the thread
 // is ending, memory has run out, or the manager is not alive.
@@ -213,7 +97,7 @@ Magazine* CurrentMagazine() {
         s_Registry = magazine;
         return magazine;
     }
-    uint32_t epoch = Get(s_Epoch);
+    uint32_t epoch = Get(g_Epoch);
     if (Get(magazine->m_Epoch) != epoch) {
         magazine->Empty();
         if (!PoolAccess::MaxSize()) return nullptr;
@@ -243,7 +127,7 @@ uint64_t CountInMagazines(unsigned k) {
     uint64_t count = 0;
     AutoSpinLock lock(s_RegistryLock);
     for (const Magazine* magazine = s_Registry; magazine; magazine = magazine->m_Next) {
-        if (Get(magazine->m_Epoch) == Get(s_Epoch)) count += Get(magazine->m_Racks[k].m_Count);
+        if (Get(magazine->m_Epoch) == Get(g_Epoch)) count += Get(magazine->m_Racks[k].m_Count);
     }
     return count;
 }
@@ -276,43 +160,6 @@ void AfterForkInChild() {
 }
 
 }  // namespace
-
-// The short paths do what Magazine::Take and Put do first, with nothing in the way.
-
-inline void* PoolAccess::Alloc(unsigned long size) {
-    Magazine* magazine = t_Magazine;
-    if (Faults::ShouldFail()) return nullptr;
-    if (size - 1 < kMaxMagazineSize && Get(magazine->m_Epoch) == Get(s_Epoch)) [[likely]] {
-        unsigned k = ClassOf(size);
-        Magazine::Rack& rack = magazine->m_Racks[k];
-        if (uint32_t count = Get(rack.m_Count)) [[likely]] {
-            Set(rack.m_Count, count - 1);
-            return HandOut(rack.m_Slots[count - 1], size, SizeOf(k));
-        }
-    }
-    return AllocSlow(size);
-}
-
-inline void PoolAccess::Free(void* p) {
-    if (!p) return;
-    Block* block = static_cast<Block*>(p) - 1;
-    uint64_t size = block->m_Size;
-    Magazine* magazine = t_Magazine;
-    // One comparison for a multiple of 8 from 8 to kMaxMagazineSize: other low bits turn up on top.
-    uint64_t index = std::rotr(size - 8, 3);
-    if (index < kRackCount - 1 && Get(magazine->m_Epoch) == Get(s_Epoch)) [[likely]] {
-        Magazine::Rack& rack = magazine->m_Racks[index + 1];
-        uint32_t count = Get(rack.m_Count);
-        if (count < rack.m_Limit) [[likely]] {
-            Poison(block, size);
-            rack.m_Slots[count] = block;
-            std::atomic_signal_fence(std::memory_order_release);
-            Set(rack.m_Count, count + 1);
-            return;
-        }
-    }
-    FreeSlow(block);
-}
 
 void* PoolAccess::AllocSlow(unsigned long size) {
     Platform::NoKill noKill;
@@ -357,7 +204,7 @@ PoolAccess::Block* PoolAccess::NewBlock(unsigned long size) {
 }
 
 uint32_t PoolAccess::LockClass(unsigned k) {
-    Count& word = Pools().m_Locks[k - 1];
+    Count& word = TheManager().m_Locks[k - 1];
     SpinWait wait;
     for (;;) {
         uint32_t count = word.exchange(kLocked, std::memory_order_acquire);
@@ -367,7 +214,7 @@ uint32_t PoolAccess::LockClass(unsigned k) {
 }
 
 void PoolAccess::UnlockClass(unsigned k, uint32_t count) {
-    Pools().m_Locks[k - 1].store(count, std::memory_order_release);
+    TheManager().m_Locks[k - 1].store(count, std::memory_order_release);
 }
 
 uint32_t PoolAccess::ListCount(unsigned k) {
@@ -378,7 +225,7 @@ uint32_t PoolAccess::ListCount(unsigned k) {
 
 // A look without the lock, which spares it where blocks are still being made.
 bool PoolAccess::IsListEmpty(unsigned k) {
-    return Get(Pools().m_Locks[k - 1]) == 0;
+    return Get(TheManager().m_Locks[k - 1]) == 0;
 }
 
 // Puts linked blocks, whose last one has no link yet, in front of the list of their class. The
@@ -450,7 +297,7 @@ Magazine* Magazine::New() {
     void* memory = malloc(sizeof(Magazine) + TotalRackSize() * sizeof(Block*));
     if (!memory) return nullptr;
     Magazine* magazine = new (memory) Magazine;
-    Set(magazine->m_Epoch, Get(s_Epoch));
+    Set(magazine->m_Epoch, Get(g_Epoch));
     magazine->m_Serial = s_NextSerial.fetch_add(1, std::memory_order_relaxed);
     Block** slots = reinterpret_cast<Block**>(magazine + 1);
     for (unsigned k = 0; k < kRackCount; k++) {
@@ -531,7 +378,7 @@ void Magazine::Send(unsigned k, uint32_t count) {
 // Gives back all blocks and grants: to the class lists, or to the system when FreeAll has asked for
 // them or the manager is gone.
 void Magazine::Empty() {
-    bool isStale = !PoolAccess::MaxSize() || Get(m_Epoch) != Get(s_Epoch);
+    bool isStale = !PoolAccess::MaxSize() || Get(m_Epoch) != Get(g_Epoch);
     for (unsigned k = 1; k < kRackCount; k++) {
         Rack& rack = m_Racks[k];
         uint32_t count = Get(rack.m_Count);
@@ -584,7 +431,7 @@ uint64_t ReusePoolManager::GetSize(unsigned long size) {
 
 void ReusePoolManager::FreeAll() {
     Platform::NoKill noKill;
-    s_Epoch.fetch_add(1, std::memory_order_relaxed);
+    g_Epoch.fetch_add(1, std::memory_order_relaxed);
     CurrentMagazine();  // empties the caller's own
     for (unsigned k = 1; k <= kClassCount; k++) PoolAccess::FreeList(k);
 }

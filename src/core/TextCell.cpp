@@ -2,7 +2,7 @@
 #include <climits>
 #include <new>
 
-#include "core/0ReusePool.h"
+#include "core/ReusePoolInternal.h"
 #include "core/TextCellInternal.h"
 
 namespace Korvel::TextCell {
@@ -26,7 +26,7 @@ uint64_t& UnusedHeaderWord(const char* cell) {
 
 char* New(unsigned long length) {
     if (length > INT_MAX - kOverhead) return nullptr;
-    char* block = static_cast<char*>(g_ReusePoolMgr.Alloc(length + kOverhead));
+    char* block = static_cast<char*>(PoolAccess::Alloc(length + kOverhead));
     if (!block) return nullptr;
     char* cell = block + sizeof(uint32_t);
     new (block) std::atomic<uint32_t>(1);
@@ -49,7 +49,7 @@ void Free(const char* cell) {
     Check(cell);
     UnusedHeaderWord(cell) = 0;
 #endif
-    g_ReusePoolMgr.Free(const_cast<char*>(cell) - sizeof(uint32_t));
+    PoolAccess::Free(const_cast<char*>(cell) - sizeof(uint32_t));
 }
 
 }  // namespace Korvel::TextCell

@@ -53,9 +53,15 @@ inline const char* Use(const char* p) {
 
 void Free(const char* cell);
 
-// Drops a holder, if the pointer is to a cell; the last one frees it.
+// Drops a holder, if the pointer is to a cell; the last one frees it. A holder that is the only one
+// needs no atomic step: nobody else can become another.
 inline void Drop(const char* p) {
-    if (IsCell(p) && Count(p).fetch_sub(1, std::memory_order_acq_rel) == 1) Free(p);
+    if (!IsCell(p)) return;
+    std::atomic<uint32_t>& count = Count(p);
+    if (count.load(std::memory_order_acquire) == 1 ||
+        count.fetch_sub(1, std::memory_order_acq_rel) == 1) {
+        Free(p);
+    }
 }
 
 // For text from outside: the byte with which `c` may stand at the head of a text.
