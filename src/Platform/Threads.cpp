@@ -350,17 +350,20 @@ bool SuspendThread(_Thread*) {
 
 bool WaitThread(_Thread* thread, unsigned int timeoutMs) {
     if (thread->m_IsJoined) return true;
-    if (thread->m_QuitEvent && !WaitEvent(thread->m_QuitEvent, timeoutMs)) return false;
-    if (thread->m_Kind == ThreadKind::Adopted) {
-        // It may go on for ever, so this is no place for the guard or the mutex. Its record goes
-        // when it ends, and what the host does with its own thread is not ours to note.
+    // Where the body ends it may drop all references but this one.
+    thread->m_RefCount.fetch_add(1, std::memory_order_relaxed);
+    bool hasEnded = !thread->m_QuitEvent || WaitEvent(thread->m_QuitEvent, timeoutMs);
+    if (hasEnded && thread->m_Kind == ThreadKind::Adopted) {
+        // It may go on for ever, so this is no place for the guard or the mutex. What the host does
+        // with its own thread is not ours to note.
         pthread_join(thread->m_OSThread, nullptr);
-    } else if (thread->m_Kind == ThreadKind::Made) {
+    } else if (hasEnded && thread->m_Kind == ThreadKind::Made) {
         NoKill noKill;
         Joining joining(*thread);
         JoinLocked(*thread);
     }
-    return true;
+    DeleteThread(thread);
+    return hasEnded;
 }
 
 bool HasThreadQuit(_Thread* thread) {
