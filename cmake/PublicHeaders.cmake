@@ -3,21 +3,34 @@ set(KORVEL_PUBLIC_HEADERS
     Platform/Event.h
     Platform/EventQueue.h
     Platform/Events.h
+    Platform/Files.h
     Platform/Lock.h
     Platform/MinList.h
     Platform/Mutex.h
     Platform/Platform.h
     Platform/Processes.h
     Platform/Strings.h
+    Platform/Thread.h
     Platform/Threads.h
     Platform/Time.h
     core/0ReusePool.h
     core/Annotations.h
     core/Export.h
+    core/MemBlock.h
     core/OxID.h
     core/OxString.h
+    core/RefObject.h
+    core/ScriptVal.h
     core/SpinLock.h
+    core/TagList.h
+    core/TagMap.h
     diag/Env.h
+    objects/LuaClass.h
+    objects/ObjectReferences.h
+    objects/Publish.h
+    objects/ScriptConfig.h
+    objects/ScriptObject.h
+    objects/ScriptSymbol.h
     runtime/lua/KRScriptLib.h
     runtime/lua/RunScript.h
 )

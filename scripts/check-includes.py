@@ -12,15 +12,15 @@ import sys
 
 # First match wins; a path is relative to src/.
 FLOORS = [
-    (r"core/(0ReusePool|ReusePoolInternal|SpinLock|TextCell|Export|Annotations|Faults)", 0),
+    (r"core/(0ReusePool|ReusePoolInternal|SpinLock|Text|Export|Annotations|Faults|NumbersInternal)", 0),
     (r"Platform/(Files|Processes|Strings)", 1),
     (r"Platform/Thread\.", 3),
     (r"Platform/", 0),
     (r"textform/", 0),
-    (r"core/(OxID|OxString|MemBlock|ScriptVal)", 1),
+    (r"core/(OxID|OxString|MemBlock|Numbers|Script)", 1),
     (r"diag/Env", 1),
     (r"objects/", 2),
-    (r"core/(RefObject|TagList)", 3),
+    (r"core/(RefObject|TagList|TagMap)", 3),
     (r"(diag|layout|paths)/", 4),
     (r"remote/", 5),
     (r"runtime/lua/", 6.1),

@@ -1,6 +1,7 @@
 #include "Platform/Processes.h"
 
 #include <strings.h>
+#include <sys/random.h>
 #include <unistd.h>
 
 #include <cstdlib>
@@ -87,6 +88,32 @@ bool PutEnv(const char* setting) {
         g_ReusePoolMgr.Free(kept);
     }
     return isDone;
+}
+
+char* NewUUID() {
+    constexpr size_t kBlockSize = 40;
+    uint8_t bytes[16];
+    ssize_t got;
+    do {
+        got = getrandom(bytes, sizeof(bytes), 0);
+    } while (got < 0 && errno == EINTR);
+    if (got != sizeof(bytes)) return nullptr;
+    bytes[6] = static_cast<uint8_t>((bytes[6] & 0x0F) | 0x40);  // version 4: random
+    bytes[8] = static_cast<uint8_t>((bytes[8] & 0x3F) | 0x80);  // the usual variant
+    char* uuid = static_cast<char*>(malloc(kBlockSize));
+    if (!uuid) return nullptr;
+    char* out = uuid;
+    for (int i = 0; i < 16; i++) {
+        if (i == 4 || i == 6 || i == 8 || i == 10) *out++ = '-';
+        *out++ = "0123456789abcdef"[bytes[i] >> 4];
+        *out++ = "0123456789abcdef"[bytes[i] & 15];
+    }
+    *out = 0;
+    return uuid;
+}
+
+void DeleteUUID(char* uuid) {
+    free(uuid);
 }
 
 }  // namespace Korvel::Platform

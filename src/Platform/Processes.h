@@ -21,4 +21,9 @@ KORVEL_EXPORT bool GetEnv(const char* name, OxStringT<char>& value);
 // empty text and when memory has run out. To tell the settings of EnvVar, call InvalidateEnv.
 KORVEL_EXPORT bool PutEnv(const char* setting);
 
+// A fresh random UUID as 36 characters of lower-case text, in a block of 40 bytes of the C heap
+// that DeleteUUID frees. Null when there is no memory or no randomness.
+KORVEL_EXPORT char* NewUUID();
+KORVEL_EXPORT void DeleteUUID(char* uuid);
+
 }  // namespace Korvel::Platform

@@ -5,6 +5,8 @@
 #include <atomic>
 #include <cstdint>
 
+#include "core/Export.h"
+
 namespace Korvel {
 
 // One wait of a spinning thread: call Step() between two looks at the contended word. It eases the
@@ -51,6 +53,32 @@ public:
 
 private:
     SpinLock& m_Lock;
+};
+
+// A spin lock that its holder may take again, and lets go as often. It is constant-initialised.
+//
+// For short stretches: no wait, no callback and no last Recycle inside. The holder cannot be
+// killed: a kill that comes meanwhile takes effect where the outermost level is let go.
+class KORVEL_EXPORT NestedSpinLock {
+public:
+    void ObtainLock();
+    void ReleaseLock();  // by the thread that has it
+
+private:
+    std::atomic<uint64_t> m_Owner{0};  // the holder's thread id; 0 when free
+    uint32_t m_Count = 0;              // guarded by the lock itself
+};
+
+// Holds a NestedSpinLock until the end of its scope.
+class AutoNestedSpinLock {
+public:
+    explicit AutoNestedSpinLock(NestedSpinLock& lock) : m_Lock(lock) { m_Lock.ObtainLock(); }
+    AutoNestedSpinLock(const AutoNestedSpinLock&) = delete;
+    AutoNestedSpinLock& operator=(const AutoNestedSpinLock&) = delete;
+    ~AutoNestedSpinLock() { m_Lock.ReleaseLock(); }
+
+private:
+    NestedSpinLock& m_Lock;
 };
 
 }  // namespace Korvel
