@@ -519,7 +519,7 @@ public:
         struct {
             char* m_String;  // a text cell
             uint32_t m_Hash;
-            uint32_t m_Probe;  // see TextProbeInternal.h
+            uint32_t m_Probe;  // four bytes of the text, for look-ups
         } m_String;
         bool m_Boolean;
         RemoteObject* m_RemoteObject;
