@@ -50,12 +50,6 @@ void SetText(ScriptVal& value, ScriptValType type, const char* cell) {
                               GetTextProbe(text, strlen(text))};
 }
 
-const char* NewCell(const char* text, size_t length) {
-    char* cell = TextCell::New(length);
-    if (cell) memcpy(cell + 1, text, length);
-    return cell;
-}
-
 // A pool block with the bytes at `from`, or zeros; false without memory. No bytes need no block.
 bool CopyBlock(void*& to, const void* from, uint32_t size) {
     to = nullptr;
@@ -70,10 +64,10 @@ bool CopyBlock(void*& to, const void* from, uint32_t size) {
     return true;
 }
 
-bool IsAlive(const ScriptVal& value) {
-    const auto& payload = value.m_Value.m_LocalObject;
-    return payload.m_Object &&
-           ObjectReferences::GetObjectReference(payload.m_Object) == payload.m_Ref;
+// Of a local object.
+bool IsAlive(const ScriptVal::Payload& payload) {
+    ScriptObject* object = payload.m_LocalObject.m_Object;
+    return object && ObjectReferences::GetObjectReference(object) == payload.m_LocalObject.m_Ref;
 }
 
 // Copying goes list by list, without recursion. A list that is not copied yet waits in its copy,
@@ -125,7 +119,7 @@ bool CopyShallow(const ScriptVal& from, ScriptVal& to, WaitingLists& waiting) {
             if (Chain::Head(from)) waiting.Push(to, Chain::Head(from));
             return true;
         case SV_LocalObject:
-            if (!IsAlive(from)) {
+            if (!IsAlive(from.m_Value)) {
                 to.m_Flags = SVF_KeptNil;
                 return true;
             }
@@ -192,10 +186,7 @@ void Make(ScriptVal& value, ScriptValType type, const void* data) {
         case SV_String: {
             const char* text = "";
             if (data) read(text);
-            if (text) {
-                SetText(value, type,
-                        TextCell::IsCell(text) ? TextCell::Use(text) : NewCell(text, strlen(text)));
-            }
+            if (text) SetText(value, type, TextCell::UseOrCopy(text));
             break;
         }
         case SV_Boolean:
@@ -219,7 +210,7 @@ void Make(ScriptVal& value, ScriptValType type, const void* data) {
             // A host may give its constructor as a plain text.
             if (char*& name = value.m_Value.m_Table.m_Constructor;
                 value.IsTable() && name && !TextCell::IsCell(name)) {
-                name = const_cast<char*>(NewCell(name, strlen(name)));
+                name = TextCell::New(name, strlen(name));
                 if (!name) value.CleanUp();
             }
             break;
@@ -294,14 +285,10 @@ void ReleaseShallow(uint32_t flags, const ScriptVal::Payload& payload) {
         case SV_RemoteObject:
             g_ScriptHooks.m_DecRemoteRef(payload.m_RemoteObject);
             break;
-        case SV_LocalObject: {
-            ScriptObject* object = payload.m_LocalObject.m_Object;
-            if (!(flags & SVF_Foreign) &&
-                ObjectReferences::GetObjectReference(object) == payload.m_LocalObject.m_Ref) {
-                object->DecRef();
-            }
+        case SV_LocalObject:
+            if (!(flags & SVF_Foreign) && IsAlive(payload))
+                payload.m_LocalObject.m_Object->DecRef();
             break;
-        }
         case SV_Code:
         case SV_MemBlock:
             g_ReusePoolMgr.Free(payload.m_MemBlock.m_Ptr);
@@ -424,7 +411,7 @@ void ScriptVal::Set(ScriptValType type, const char* const* text, int length) {
     ScriptVal made;
     if ((type & SVF_TypeMask) == SV_String && text && *text) {
         size_t size = length > 0 ? static_cast<size_t>(length) : 0;
-        char* cell = const_cast<char*>(NewCell(*text, size));
+        char* cell = TextCell::New(*text, size);
         if (cell) cell[1] = TextCell::SafeFirstByte(cell[1]);
         SetText(made, type, cell);
     }
@@ -467,7 +454,7 @@ bool ScriptVal::IsValidRemoteObject() const {
 }
 
 const void* ScriptVal::GetData() const {
-    if (IsNull(this) || (Is(SV_LocalObject) && !IsAlive(*this))) return nullptr;
+    if (IsNull(this) || (Is(SV_LocalObject) && !IsAlive(m_Value))) return nullptr;
     return &m_Value;
 }
 
@@ -505,7 +492,7 @@ long long ScriptVal::ToInteger(long long def) const {
 }
 
 ScriptObject* ScriptVal::ToLocalObject(ScriptObject* def) const {
-    if (Is(SV_LocalObject)) return IsAlive(*this) ? m_Value.m_LocalObject.m_Object : nullptr;
+    if (Is(SV_LocalObject)) return IsAlive(m_Value) ? m_Value.m_LocalObject.m_Object : nullptr;
     if (!IsRemoteObject()) return def;
     ScriptObject* object = g_ScriptHooks.m_GetLocalPointer(m_Value.m_RemoteObject);
     return object ? object : def;

@@ -1,9 +1,11 @@
 // Tables and args lists: their chains, look-ups by key and by path, and what is done entry by
 // entry.
+#include <algorithm>
 #include <cmath>
+#include <cstdio>
 #include <cstdlib>
+#include <iterator>
 
-#include "core/ScriptHooksInternal.h"
 #include "core/ScriptValInternal.h"
 #include "core/TextProbeInternal.h"
 #include "objects/ScriptSymbol.h"

@@ -75,13 +75,6 @@ char* NewText(const char* text, size_t length) {
     return copy;
 }
 
-char* NewCell(const char* text) {
-    size_t length = strlen(text);
-    char* cell = TextCell::New(length);
-    if (cell) memcpy(cell + 1, text, length);
-    return cell;
-}
-
 }  // namespace
 
 constinit const Word TagList::EmptyTags[1] = {TAG_END};
@@ -146,8 +139,7 @@ bool TagList::CopyValue(Word tag, Word& word) {
         }
         case TAG_ID: {
             // A plain text in a borrowed array need not outlive it.
-            const char* text = AsPointer<const char>(word);
-            const char* cell = TextCell::IsCell(text) ? TextCell::Use(text) : NewCell(text);
+            const char* cell = TextCell::UseOrCopy(AsPointer<const char>(word));
             if (!cell) return false;
             word = AsWord(cell);
             break;
@@ -313,11 +305,23 @@ RefObject* TagList::GetObject(const Word* item) {
     return object;
 }
 
+// Reads the value of the first item with a tag. The former content of `out` goes when the list is
+// no longer locked.
+template <class T>
+static bool ReadFirst(const TagList& list, Word tag, T& out, T (*read)(const Word* item)) {
+    T value{};
+    {
+        AutoTagListLock guard(list);
+        const Word* item = list.Find(tag);
+        if (!item) return false;
+        value = read(item);
+    }
+    out = std::move(value);
+    return true;
+}
+
 bool TagList::Get(Word tag, unsigned int& out) const {
-    AutoTagListLock guard(*this);
-    const Word* item = Find(tag);
-    if (item) out = GetLong(item);
-    return item != nullptr;
+    return ReadFirst(*this, tag, out, GetLong);
 }
 bool TagList::Get(Word tag, int& out) const {
     unsigned int bits;
@@ -326,45 +330,23 @@ bool TagList::Get(Word tag, int& out) const {
     return isThere;
 }
 bool TagList::Get(Word tag, bool& out) const {
-    AutoTagListLock guard(*this);
-    const Word* item = Find(tag);
-    if (item) out = GetBool(item);
-    return item != nullptr;
+    return ReadFirst(*this, tag, out, GetBool);
 }
 bool TagList::Get(Word tag, double& out) const {
-    AutoTagListLock guard(*this);
-    const Word* item = Find(tag);
-    if (item) out = GetDouble(item);
-    return item != nullptr;
+    return ReadFirst(*this, tag, out, GetDouble);
 }
 bool TagList::Get(Word tag, char*& out) const {
-    AutoTagListLock guard(*this);
-    const Word* item = Find(tag);
-    if (item) out = AsPointer<char>(ValueOf(item));
-    return item != nullptr;
+    return ReadFirst<char*>(*this, tag, out,
+                            [](const Word* item) { return AsPointer<char>(ValueOf(item)); });
 }
 bool TagList::Get(Word tag, OxID& out) const {
-    OxID id;
-    {
-        AutoTagListLock guard(*this);
-        const Word* item = Find(tag);
-        if (!item) return false;
-        id = GetID(item);
-    }
-    out = std::move(id);
-    return true;
+    return ReadFirst(*this, tag, out, GetID);
 }
 bool TagList::Get(Word tag, TagList*& out) const {
-    AutoTagListLock guard(*this);
-    const Word* item = Find(tag);
-    if (item) out = GetTagList(item);
-    return item != nullptr;
+    return ReadFirst(*this, tag, out, GetTagList);
 }
 bool TagList::Get(Word tag, RefObject*& out) const {
-    AutoTagListLock guard(*this);
-    const Word* item = Find(tag);
-    if (item) out = GetObject(item);
-    return item != nullptr;
+    return ReadFirst(*this, tag, out, GetObject);
 }
 bool TagList::Get(Word tag, void* out) const {
     if (TypeOfTag(tag) == TAG_ID) return Get(tag, *static_cast<OxID*>(out));
@@ -409,9 +391,8 @@ OxID TagList::GetID(Word tag, const OxID& def) const {
     return Get(tag, id) ? id : def;
 }
 void* TagList::GetPtr(Word tag, void* def) const {
-    AutoTagListLock guard(*this);
-    const Word* item = Find(tag);
-    return item ? GetPtr(item) : def;
+    ReadFirst(*this, tag, def, GetPtr);
+    return def;
 }
 TagList* TagList::GetTagList(Word tag, TagList* def) const {
     Get(tag, def);

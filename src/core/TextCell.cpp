@@ -1,5 +1,6 @@
 #include <cassert>
 #include <climits>
+#include <cstring>
 #include <new>
 
 #include "core/ReusePoolInternal.h"
@@ -36,6 +37,16 @@ char* New(unsigned long length) {
     UnusedHeaderWord(cell) = kSignature;
 #endif
     return cell;
+}
+
+char* New(const char* text, unsigned long length) {
+    char* cell = New(length);
+    if (cell) memcpy(cell + 1, text, length);
+    return cell;
+}
+
+const char* UseOrCopy(const char* text) {
+    return IsCell(text) ? Use(text) : New(text, strlen(text));
 }
 
 #ifndef NDEBUG

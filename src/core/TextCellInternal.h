@@ -21,6 +21,8 @@ constexpr char kMarker = '\xFF';
 // A new cell with count 1 and room for `length` bytes; the marker and the last NUL stand, the text
 // is the caller's to write. Null when memory has run out.
 char* New(unsigned long length);
+// The same with these bytes for its text.
+char* New(const char* text, unsigned long length);
 
 // Asserts in debug builds that `cell` points at a cell's marker.
 #ifdef NDEBUG
@@ -50,6 +52,10 @@ inline const char* Use(const char* p) {
     }
     return p;
 }
+
+// A holder's pointer for a text that need not last: the cell with one holder more, or a new cell
+// with a copy of a plain text. Null when memory has run out.
+const char* UseOrCopy(const char* text);
 
 void Free(const char* cell);
 
