@@ -10,7 +10,7 @@ namespace Korvel {
 
 class TagList;
 template <class T>
-class OxStringT;
+class KORVEL_EXPORT OxStringT;
 
 // The hash of names and keys: 32 bits, blind to the case of A to Z and of nothing else. A null text
 // and a length below 1 give 0. The form with a length does not stop at a NUL. The list is not used.

@@ -13,7 +13,7 @@
 namespace Korvel {
 
 template <class T>
-class OxStringT;
+class KORVEL_EXPORT OxStringT;
 
 template <class T>
 concept ByteUnit = std::same_as<T, char>;
