@@ -10,17 +10,25 @@ void QueueNode::Reply() {
     if (!IsNull(this)) delete this;
 }
 
-void EventQueue::Put(QueueNode* node) {
-    if (!node) return;
+bool EventQueue::Put(QueueNode* node) {
+    if (!node) return true;
     Platform::NoKill noKill;
     const void* sleeper;
     {
         AutoLock guard(*this);
+        if (m_IsClosed) return false;
         Add(node);
         sleeper = Platform::SetEventQuietly(GetEvent());
     }
     // From here on the taker may have deleted the queue.
     if (sleeper) Platform::FutexWake(sleeper, 1);
+    return true;
+}
+
+void EventQueue::Close() {
+    Platform::NoKill noKill;
+    AutoLock guard(*this);
+    m_IsClosed = true;
 }
 
 QueueNode* EventQueue::Get() {

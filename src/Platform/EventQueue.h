@@ -35,11 +35,18 @@ private:
 //            (GetEvent is null) never lets a waiter through.
 class KORVEL_EXPORT EventQueue : public MinListT<QueueNode>, public Lock, public Event {
 public:
-    // Takes over the node and signals. Null is ignored.
-    void Put(QueueNode* node);
+    // Takes over the node and signals. Null is ignored. False when the queue has been closed: the
+    // node is then still the caller's.
+    bool Put(QueueNode* node);
 
     // The oldest node, the caller's until Reply; null when there is none. It does not wait.
     QueueNode* Get();
+
+    // From here on Put takes nothing more. What is queued can still be got.
+    void Close();
+
+private:
+    bool m_IsClosed = false;  // guarded by the lock
 };
 
 }  // namespace Korvel::KorvelScript

@@ -1,13 +1,34 @@
 #include "Platform/Files.h"
 
+#include <dlfcn.h>
 #include <fcntl.h>
+#include <limits.h>
 
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 
 namespace Korvel::Platform {
+namespace {
 
 static_assert(sizeof(off_t) == 8);
+static_assert(kMaxPath >= PATH_MAX);
+
+// Found while the library is loaded, for the loader may know it by a path that is relative to the
+// directory of that time.
+struct LibraryFolder {
+    LibraryFolder() {
+        Dl_info library;
+        if (!dladdr(this, &library) || !realpath(library.dli_fname, m_Path)) return;
+        m_Length = strrchr(m_Path, '/') + 1 - m_Path;
+    }
+
+    long m_Length = 0;
+    char m_Path[kMaxPath];
+};
+const LibraryFolder s_LibraryFolder;
+
+}  // namespace
 
 FILE* fopen(const char* path, const char* mode) {
     constexpr size_t kMaxMode = 30;
@@ -30,6 +51,15 @@ FILE* fdopen(int fd, const char* mode) {
     FILE* file = ::fdopen(fd, mode);
     if (file) fcntl(fd, F_SETFD, FD_CLOEXEC);
     return file;
+}
+
+int GetSystemFolder(SysFolder folder, char* buf, int size) {
+    if (!buf) return kMaxPath;
+    long length = folder == SF_Library ? s_LibraryFolder.m_Length : 0;
+    if (length == 0 || length >= size) return 0;
+    memcpy(buf, s_LibraryFolder.m_Path, static_cast<size_t>(length));
+    buf[length] = 0;
+    return kMaxPath;
 }
 
 }  // namespace Korvel::Platform

@@ -12,4 +12,15 @@ namespace Korvel::Platform {
 KORVEL_EXPORT FILE* fopen(const char* path, const char* mode);
 KORVEL_EXPORT FILE* fdopen(int fd, const char* mode);
 
+// Folders that GetSystemFolder knows.
+enum SysFolder : unsigned int {
+    SF_Library = 0,  // that holds this library
+};
+
+constexpr int kMaxPath = 4096;  // bytes of a path, its end included
+
+// Writes a folder's path, with a slash behind it, to `buf`, which has room for `size` bytes.
+//   returns  kMaxPath, also for a null `buf`; 0 when the folder is not known or `size` too small
+KORVEL_EXPORT int GetSystemFolder(SysFolder folder, char* buf, int size);
+
 }  // namespace Korvel::Platform

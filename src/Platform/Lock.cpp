@@ -13,6 +13,9 @@ Lock::~Lock() {
 bool Lock::ObtainLock() {
     return Platform::ObtainMutex(m_Mutex, Platform::kNoTimeLimit);
 }
+bool Lock::TryObtainLock() {
+    return Platform::ObtainMutex(m_Mutex, 0);
+}
 void Lock::ReleaseLock() {
     Platform::ReleaseMutex(m_Mutex);
 }

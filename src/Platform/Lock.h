@@ -20,8 +20,9 @@ public:
     Lock& operator=(const Lock&) = delete;
     virtual ~Lock();  // nobody may hold it
 
-    bool ObtainLock();   // blocks; true when the calling thread has it
-    void ReleaseLock();  // one level, by the thread that has it
+    bool ObtainLock();     // blocks; true when the calling thread has it
+    bool TryObtainLock();  // does not wait; false while another thread has it
+    void ReleaseLock();    // one level, by the thread that has it
 
 private:
     Platform::_Mutex* m_Mutex;

@@ -59,6 +59,11 @@ struct _Thread : Reuser {
     std::atomic<bool> m_IsJoined{false};       // written under m_JoinMutex
 };
 
+// Adds a reference, for somebody who has one or is told by one who has. DeleteThread drops it.
+inline void HoldThread(_Thread* thread) {
+    thread->m_RefCount.fetch_add(1, std::memory_order_relaxed);
+}
+
 // The calling thread's record; null as long as a thread that is not ours has not been adopted.
 extern constinit thread_local _Thread* t_ThisThread __attribute__((tls_model("initial-exec")));
 

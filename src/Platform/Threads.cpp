@@ -351,7 +351,7 @@ bool SuspendThread(_Thread*) {
 bool WaitThread(_Thread* thread, unsigned int timeoutMs) {
     if (thread->m_IsJoined) return true;
     // Where the body ends it may drop all references but this one.
-    thread->m_RefCount.fetch_add(1, std::memory_order_relaxed);
+    HoldThread(thread);
     bool hasEnded = !thread->m_QuitEvent || WaitEvent(thread->m_QuitEvent, timeoutMs);
     if (hasEnded && thread->m_Kind == ThreadKind::Adopted) {
         // It may go on for ever, so this is no place for the guard or the mutex. What the host does

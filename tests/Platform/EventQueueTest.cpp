@@ -61,7 +61,10 @@ TEST(EventQueue, SendersAndTakers) {
             QueueNode* node = Take(queue);
             ASSERT_NE(node, nullptr);
             unsigned sender = node->GetType() / kEachSends, number = node->GetType() % kEachSends;
-            if (sender == kSenders) return queue.Put(node);  // the end, for the other taker, too
+            if (sender == kSenders) {
+                queue.Put(node);  // the end, for the other taker, too
+                return;
+            }
             EXPECT_GE(number, next[sender]);
             next[sender] = number + 1;
             node->Reply();
