@@ -1,4 +1,5 @@
-# `cmake --install`: the library, the tool, the headers, a CMake package and a pkg-config file.
+# `cmake --install`: the library, its names as a Lua module, the tool, the headers, a CMake package
+# and a pkg-config file.
 
 include(CMakePackageConfigHelpers)
 
@@ -8,6 +9,10 @@ set(KORVEL_PACKAGE_DIR ${CMAKE_INSTALL_LIBDIR}/cmake/korvelscript)
 install(TARGETS korvelscript EXPORT korvelscriptTargets
     LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR}
     INCLUDES DESTINATION ${KORVEL_HEADER_DIR}
+)
+install(FILES ${CMAKE_LIBRARY_OUTPUT_DIRECTORY}/krscript.so DESTINATION ${CMAKE_INSTALL_LIBDIR})
+install(FILES ${PROJECT_BINARY_DIR}/src/lua/krscript.so
+    DESTINATION ${CMAKE_INSTALL_LIBDIR}/lua/5.1
 )
 install(TARGETS oxscript RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
 foreach(header IN LISTS KORVEL_PUBLIC_HEADERS)

@@ -32,5 +32,7 @@ set(KORVEL_PUBLIC_HEADERS
     objects/ScriptObject.h
     objects/ScriptSymbol.h
     runtime/lua/KRScriptLib.h
+    runtime/lua/LuaType.h
+    runtime/lua/LuaValues.h
     runtime/lua/RunScript.h
 )

@@ -6,6 +6,8 @@ struct lua_State;
 
 namespace Korvel {
 
+class LuaType;
+
 // The part of an object that Lua sees.
 class KORVEL_EXPORT LuaClass {
 public:
@@ -13,6 +15,9 @@ public:
 
     // Pushes the object to Lua; the base pushes nil. Returns the number of values pushed, 1.
     virtual int lw_push(lua_State* L);
+
+    // The root of all Lua types, named "LuaClass".
+    static LuaType& s_LuaType;
 };
 
 }  // namespace Korvel

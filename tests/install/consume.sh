@@ -1,6 +1,7 @@
 #!/bin/sh
 # consume.sh CMAKE BUILD SOURCE COMPILER FLAGS: installs a build into a place of its own and builds
-# and runs a consumer against it, once through the CMake package and once through pkg-config.
+# and runs a consumer against it, once through the CMake package and once through pkg-config, and
+# requires it from Lua interpreters.
 set -eu
 cmake=$1 build=$2 source=$3 compiler=$4 flags=$5
 place=$(mktemp -d)
@@ -39,6 +40,15 @@ export PKG_CONFIG_PATH
 LD_LIBRARY_PATH=$(pkg-config --variable=libdir korvelscript)
 export LD_LIBRARY_PATH
 check "$place/consumer"
+
+# As a Lua module, by either name. A sanitized library does not load into a plain program.
+if [ -z "$flags" ]; then
+    for folder in "$LD_LIBRARY_PATH" "$LD_LIBRARY_PATH/lua/5.1"; do
+        for lua in luajit lua5.1; do
+            LUA_CPATH="$folder/?.so" $lua -e 'assert(require "krscript" == orv)'
+        done
+    done
+fi
 
 unset LD_LIBRARY_PATH
 "$place/installed/bin/oxscript" --version

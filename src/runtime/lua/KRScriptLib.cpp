@@ -6,10 +6,11 @@
 #include <unistd.h>
 
 #include <cstring>
-#include <lua.hpp>
 
 #include "Platform/Lock.h"
 #include "Platform/Time.h"
+#include "runtime/lua/KRScriptLibInternal.h"
+#include "runtime/lua/LuaValues.h"
 
 extern "C" int luaopen_lpeg(lua_State* L);
 
@@ -30,7 +31,7 @@ int getpid(lua_State* L) {
     return 1;
 }
 
-// Sleeps. The duration is in seconds; nothing but a number above 0 sleeps.
+// Sleeps. The duration is in seconds; what is no number above 0 does not sleep.
 int wait(lua_State* L) {
     double ms = lua_tonumber(L, 1) * 1000;
     if (ms > 0) Platform::Wait(static_cast<unsigned long long>(ms < kMaxWaitMs ? ms : kMaxWaitMs));
@@ -46,14 +47,6 @@ int gettime(lua_State* L) {
     lua_pushnumber(L, static_cast<double>(Platform::GetTimeCount()) /
                           static_cast<double>(Platform::GetTimeFreq()));
     return 1;
-}
-
-// Sets a global to the value on top of the stack, whatever a script has done to the globals'
-// metatable.
-void SetGlobalRaw(lua_State* L, const char* name) {
-    lua_pushstring(L, name);
-    lua_insert(L, -2);
-    lua_rawset(L, LUA_GLOBALSINDEX);
 }
 
 // os.exit: leaves the code and the data in two globals and ends the script with an empty error. The
@@ -73,49 +66,53 @@ int myexit(lua_State* L) {
 }
 
 constexpr luaL_Reg kFunctions[] = {
-    {"getpid", getpid},   {"wait", wait},   {"getuptime", getuptime},
-    {"gettime", gettime}, {"exit", myexit}, {nullptr, nullptr},
+    {"getpid", getpid}, {"wait", wait},       {"getuptime", getuptime},   {"gettime", gettime},
+    {"exit", myexit},   {"using", activeobj}, {"getusing", getactiveobj}, {nullptr, nullptr},
 };
 
-void SetVersion(lua_State* L, int library) {
-    lua_pushliteral(L, "_VERSION");
-    lua_pushstring(L, kVersion);
-    lua_rawset(L, library);
-}
-
-// Opens the library under its second name: a table of its own with the very functions of the first.
+// Opens the library under its second name: a table of its own with all that the first one holds.
 void OpenTwin(lua_State* L, const char* name, int original) {
     constexpr luaL_Reg kNothing[] = {{nullptr, nullptr}};
     luaL_register(L, name, kNothing);
-    int twin = lua_gettop(L);
-    for (const luaL_Reg* function = kFunctions; function->name; function++) {
-        lua_getfield(L, original, function->name);
-        lua_setfield(L, twin, function->name);
+    lua_pushnil(L);
+    while (lua_next(L, original)) {
+        lua_pushvalue(L, -2);
+        lua_insert(L, -2);
+        lua_rawset(L, -4);
     }
-    SetVersion(L, twin);
+    lua_pop(L, 1);
+}
+
+// Puts a searcher behind the first one, which looks at what has been preloaded, and before those
+// that look for files.
+void InsertLoader(lua_State* L, lua_CFunction loader) {
+    lua_getfield(L, -1, "loaders");
+    for (int i = static_cast<int>(lua_objlen(L, -1)); i >= 2; i--) {
+        lua_rawgeti(L, -1, i);
+        lua_rawseti(L, -2, i + 1);
+    }
+    lua_pushcfunction(L, loader);
+    lua_rawseti(L, -2, 2);
+    lua_pop(L, 1);
 }
 
 }  // namespace
 
-void require(lua_State* L, const char* name, bool setGlobal) {
-    lua_getglobal(L, "require");
-    lua_pushstring(L, name);
-    if (lua_pcall(L, 1, 1, 0) == 0 && setGlobal) {
-        lua_setglobal(L, name);
-    } else {
-        lua_pop(L, 1);
-    }
-}
-
 void OpenAllLibs(lua_State* L, TagList*) {
+    lua_gc(L, LUA_GCSTOP, 0);  // what is made here stays
     luaL_openlibs(L);
     lua_getglobal(L, "package");
-    lua_getfield(L, -1, "preload");
+    int package = lua_gettop(L);
+    InsertLoader(L, myloader);
+    lua_getfield(L, package, "preload");
     lua_pushcfunction(L, luaopen_lpeg);
     lua_setfield(L, -2, "lpeg");
     require(L, "lpeg", true);
+    lua_getfield(L, package, "loaded");
     luaopen_krscript(L);
+    lua_setfield(L, -2, "krscript");
     lua_settop(L, 0);
+    lua_gc(L, LUA_GCRESTART, -1);  // with the pause that follows a collection
 }
 
 void CloseAllLibs(lua_State*, TagList*) {}
@@ -147,9 +144,12 @@ void SetArgs(lua_State* L, char** argv, int first) {
 }  // namespace Korvel
 
 extern "C" int luaopen_krscript(lua_State* L) {
+    Korvel::register_memblock(L);
     luaL_register(L, "orv", Korvel::kFunctions);
     int orv = lua_gettop(L);
-    Korvel::SetVersion(L, orv);
+    lua_pushliteral(L, "_VERSION");
+    lua_pushstring(L, Korvel::kVersion);
+    lua_rawset(L, orv);
     Korvel::OpenTwin(L, "ondry", orv);
     lua_getglobal(L, "os");
     if (lua_istable(L, -1)) {
@@ -157,5 +157,7 @@ extern "C" int luaopen_krscript(lua_State* L) {
         lua_setfield(L, -2, "exit");
     }
     lua_settop(L, orv);
+    Korvel::RunStartupScripts(L);
+    Korvel::SetGlobalIndex(L);
     return 1;
 }

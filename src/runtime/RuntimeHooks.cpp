@@ -1,0 +1,7 @@
+#include "runtime/RuntimeHooksInternal.h"
+
+namespace Korvel {
+
+constinit RuntimeHooks g_RuntimeHooks;
+
+}  // namespace Korvel
