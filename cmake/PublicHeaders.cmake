@@ -31,8 +31,14 @@ set(KORVEL_PUBLIC_HEADERS
     objects/ScriptConfig.h
     objects/ScriptObject.h
     objects/ScriptSymbol.h
+    runtime/Script.h
+    runtime/ScriptDebug.h
+    runtime/ScriptLanguage.h
     runtime/lua/KRScriptLib.h
+    runtime/lua/LuaLanguage.h
     runtime/lua/LuaType.h
     runtime/lua/LuaValues.h
     runtime/lua/RunScript.h
+    runtime/python/Py2Language.h
+    runtime/python/Py3Language.h
 )
