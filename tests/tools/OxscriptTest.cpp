@@ -18,6 +18,13 @@ protected:
         return RunProcess(argv);
     }
 
+    // Runs it with these options, and with a text for its standard input.
+    ProcessResult RunInput(const std::string& text, std::vector<std::string> args = {}) {
+        std::string input = m_Dir.Write("input", text);
+        args.insert(args.begin(), {"/bin/sh", "-c", "exec \"$@\" <" + input, "sh", OXSCRIPT});
+        return RunProcess(args);
+    }
+
     TempDir m_Dir;
 };
 
@@ -84,15 +91,64 @@ TEST_F(Oxscript, TellsWhatCannotBeLoaded) {
 TEST_F(Oxscript, ExplainsItself) {
     ProcessResult help = RunProcess({OXSCRIPT, "--help"});
     EXPECT_EQ(help.m_Status, 0);
-    EXPECT_TRUE(Contains(help.m_Out, "Usage: oxscript FILE [ARGS...]")) << help.m_Out;
+    EXPECT_TRUE(Contains(help.m_Out, "Usage: oxscript [OPTIONS] FILE [ARGS...]")) << help.m_Out;
     ProcessResult version = RunProcess({OXSCRIPT, "--version"});
     EXPECT_EQ(version.m_Status, 0);
     EXPECT_TRUE(Contains(version.m_Out, "oxscript 18.")) << version.m_Out;
-    for (const std::vector<std::string>& wrong :
-         {std::vector<std::string>{OXSCRIPT}, {OXSCRIPT, "--unknown", "x.lua"}}) {
-        ProcessResult result = RunProcess(wrong);
-        EXPECT_EQ(result.m_Status, 2);
-        EXPECT_TRUE(Contains(result.m_Err, "Usage:")) << result.m_Err;
+}
+
+TEST_F(Oxscript, RefusesAWrongCommandLine) {
+    struct Case {
+        std::vector<std::string> args;
+        const char* message;
+    };
+    const Case cases[] = {{{"--unknown", "x.lua"}, "Usage:"},
+                          {{"-e"}, "Usage:"},
+                          {{"-l", "cobol", "x.lua"}, "there is no language 'cobol'"},
+                          {{"-l", "Py2", "x.lua"}, "the language Python2 is not available"},
+                          {{"x.py3"}, "the language Python3 is not available"},
+                          {{"a.b/x.txt"}, "no language has files like x.txt; name one with -l"}};
+    for (const Case& c : cases) {
+        ProcessResult result = RunInput("print('run')", c.args);
+        EXPECT_EQ(result.m_Status, 2) << c.message;
+        EXPECT_EQ(result.m_Out, "") << c.message;
+        EXPECT_TRUE(Contains(result.m_Err, c.message)) << result.m_Err;
+    }
+}
+
+TEST_F(Oxscript, RunsTextsAndItsInput) {
+    std::string file = m_Dir.Write("\xff=1.Lua", "return one + 4");  // no text, and no argument
+    std::string program = m_Dir.Write(".d.txt", "return arg.n");
+    struct Case {
+        std::vector<std::string> args;
+        std::string input;
+        int status;
+        std::string out;
+        std::string err;
+    };
+    const Case cases[] = {
+        {{"-e", "one = 1", "-e", "print(one) return 2"}, "return 9", 2, "1\n", ""},
+        {{"-e", "one = 1", file}, "", 5, "", ""},
+        {{"-e", "error('x')", file}, "", 255, "", "oxscript: (command line):1: x\n"},
+        {{"-e", "os.exit(3)", file}, "", 3, "", ""},
+        {{"-q", "-e", "error('x', 0)"}, "", 255, "", "x\nstack traceback:\n"},
+        {{"-e", "-- \xc3("}, "", 255, "", "oxscript: (command line):1: this is not UTF-8 text"},
+        {{"-l", "LUA", program, "a"}, "", 1, "", ""},
+        {{}, "#!/bin/sh\nprint(arg[1])\nreturn 4", 4, "nil\n", ""},
+        {{"-", "a"}, "print(arg[0], arg[1])", 0, "-\ta\n", ""},
+        {{}, "print(1)\n+", 255, "", "oxscript: stdin:2: "},
+        {{}, std::string("x\n\0", 3), 255, "", "oxscript: stdin:2: this is not UTF-8 text"},
+        {{"-"}, "\xff", 255, "", "oxscript: stdin:1: this is not UTF-8 text"},
+        {{"-"}, "\x1bLJ\x02", 255, "", "oxscript: stdin:1: this is not UTF-8 text"},
+        {{"-"}, "print(1) error('', 0)", 255, "1\n", "oxscript: \n"},
+        {{"-q", "-i"}, "1, nil\nfor i = 1, 2 do\nend\nos.exit(8)", 8, "1\tnil\n", ""},
+    };
+    for (const Case& c : cases) {
+        ProcessResult result = RunInput(c.input, c.args);
+        EXPECT_EQ(result.m_Status, c.status) << c.input;
+        EXPECT_EQ(result.m_Out, c.out) << c.input;
+        EXPECT_EQ(result.m_Err.substr(0, c.err.size()), c.err) << result.m_Err;
+        EXPECT_EQ(result.m_Err.empty(), c.err.empty()) << result.m_Err;
     }
 }
 
