@@ -7,6 +7,7 @@ set(KORVEL_PUBLIC_HEADERS
     Platform/Lock.h
     Platform/MinList.h
     Platform/Mutex.h
+    Platform/Networking.h
     Platform/Platform.h
     Platform/Processes.h
     Platform/Strings.h
@@ -24,6 +25,7 @@ set(KORVEL_PUBLIC_HEADERS
     core/SpinLock.h
     core/TagList.h
     core/TagMap.h
+    diag/Debug.h
     diag/Env.h
     objects/LuaClass.h
     objects/ObjectReferences.h

@@ -1,9 +1,13 @@
 #include "Platform/Processes.h"
 
+#include <signal.h>
 #include <strings.h>
 #include <sys/random.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdlib>
 #include <cstring>
 #include <type_traits>
@@ -42,6 +46,17 @@ private:
 };
 
 }  // namespace
+
+void InitProcess() {
+    constexpr rlim_t kWantedFiles = 10000;
+    rlimit files;
+    if (getrlimit(RLIMIT_NOFILE, &files) == 0) {
+        files.rlim_cur = std::min(std::max(files.rlim_cur, kWantedFiles), files.rlim_max);
+        setrlimit(RLIMIT_NOFILE, &files);
+    }
+    signal(SIGPIPE, SIG_IGN);
+    umask(0);
+}
 
 char** GetEnviron() {
     return environ;

@@ -5,6 +5,10 @@
 
 namespace Korvel::Platform {
 
+// Makes the process fit for many connections; for the start of a program. It lets it open at least
+// 10000 files, as far as the system allows it, ignores SIGPIPE and clears the umask.
+KORVEL_EXPORT void InitProcess();
+
 // The process environment, one block for all threads. Whoever walks it does so between the two
 // lock operations; GetEnv and PutEnv take the lock themselves. The lock nests.
 KORVEL_EXPORT char** GetEnviron();

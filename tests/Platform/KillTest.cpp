@@ -24,7 +24,9 @@
 #include "Platform/Processes.h"
 #include "Platform/Threads.h"
 #include "Platform/Time.h"
+#include "Support.h"
 #include "core/0ReusePool.h"
+#include "diag/Debug.h"
 
 extern "C" KORVEL_EXPORT const char* __asan_default_options();
 extern "C" const char* __asan_default_options() {
@@ -340,6 +342,20 @@ TEST(Kill, WaitsForTheEndOfAGuardAndGivesUp) {
     guardEnd = 0;
     EXPECT_FALSE(WaitThread(thread, 50));  // no signal is left over from the kill that gave up
     ExpectKilled(thread);
+}
+
+TEST(Kill, LeavesALogPrintable) {
+    Korvel::Test::TempDir dir;
+    DebugLog log(nullptr, dir.Path("log").c_str(), true);
+    Body print = [&] {
+        s_IsAtWork.Signal();
+        for (;;) log.PrintF("x\n");
+    };
+    for (int i = 0; i < 50; i++) {
+        ExpectKilled(StartAtWork(print));
+        ASSERT_TRUE(log.TryObtainLock());
+        log.ReleaseLock();
+    }
 }
 
 TEST(Kill, SignalIsRefusedToStrangersAndIgnoredWithoutAKill) {
