@@ -33,6 +33,10 @@ set(KORVEL_PUBLIC_HEADERS
     objects/ScriptConfig.h
     objects/ScriptObject.h
     objects/ScriptSymbol.h
+    remote/Packets.h
+    remote/RemoteApp.h
+    remote/RemoteObject.h
+    remote/ScriptPort.h
     runtime/Script.h
     runtime/ScriptDebug.h
     runtime/ScriptLanguage.h

@@ -9,7 +9,6 @@
 #include "core/NumbersInternal.h"
 #include "core/ScriptHooksInternal.h"
 #include "core/ScriptValInternal.h"
-#include "core/TextProbeInternal.h"
 #include "objects/ObjectReferences.h"
 #include "objects/ScriptObject.h"
 
@@ -40,14 +39,6 @@ constinit thread_local ScriptVal t_Invalid;
 // The bits that a copy takes over.
 constexpr ScriptValType CopiedFlags(const ScriptVal& from) {
     return static_cast<ScriptValType>(from.m_Flags & ~SVF_ReadOnly);
-}
-
-void SetText(ScriptVal& value, ScriptValType type, const char* cell) {
-    if (!cell) return;
-    value.m_Flags = type;
-    const char* text = cell + 1;
-    value.m_Value.m_String = {const_cast<char*>(cell), GetHashValue(text),
-                              GetTextProbe(text, strlen(text))};
 }
 
 // A pool block with the bytes at `from`, or zeros; false without memory. No bytes need no block.
@@ -186,7 +177,9 @@ void Make(ScriptVal& value, ScriptValType type, const void* data) {
         case SV_String: {
             const char* text = "";
             if (data) read(text);
-            if (text) SetText(value, type, TextCell::UseOrCopy(text));
+            if (const char* cell = text ? TextCell::UseOrCopy(text) : nullptr) {
+                AdoptText(value, type, cell, strlen(cell + 1));
+            }
             break;
         }
         case SV_Boolean:
@@ -412,8 +405,10 @@ void ScriptVal::Set(ScriptValType type, const char* const* text, int length) {
     if ((type & SVF_TypeMask) == SV_String && text && *text) {
         size_t size = length > 0 ? static_cast<size_t>(length) : 0;
         char* cell = TextCell::New(*text, size);
-        if (cell) cell[1] = TextCell::SafeFirstByte(cell[1]);
-        SetText(made, type, cell);
+        if (cell) {
+            cell[1] = TextCell::SafeFirstByte(cell[1]);
+            AdoptText(made, type, cell, strlen(cell + 1));
+        }
     }
     *this = std::move(made);
 }

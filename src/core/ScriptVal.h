@@ -56,6 +56,11 @@ constexpr uint32_t SVF_ReplyDeferred = 0x200000;  // args: the reply comes later
 constexpr uint32_t SVF_CallDelay = 0x800000;      // args: this call is paced
 constexpr uint32_t SVF_ForceDelay = 0x1000000;    // args: the reply of this call waits 500 ms
 constexpr uint32_t SVF_FromWire = 0x80000000;     // args: came in a packet
+constexpr uint32_t SVF_ForeignCode = 0x100000;    // code: came from another process
+
+// How many tables and args lists may stand one in another where values come from outside or leave
+// for it: in packets, in Lua, in JSON.
+constexpr int kMaxNesting = 256;
 
 constexpr ScriptValType operator|(ScriptValType type, uint32_t flags) {
     return static_cast<ScriptValType>(static_cast<uint32_t>(type) | flags);
@@ -459,6 +464,40 @@ public:
     // A fresh random UUID as text.
     static ScriptVal CreateUUID();
     static void CreateUUID(ScriptVal& value);
+
+    // The wire form (docs/protocol.md). Objects are counted on the connection; without one, or on
+    // one that is closed, they go out without a number, and come in as nil. Defined with the
+    // connections.
+
+    // The bytes that ToPkt writes; 0 for a value that nests deeper than kMaxNesting or would take
+    // more than 32 bits can tell.
+    uint32_t CalcPktSize() const;
+    // Writes the value to where the cursor points and moves that to the end. There must be as much
+    // room as CalcPktSize told, which must not be 0.
+    bool ToPkt(RemoteApp* app, unsigned char*& cursor) const;
+    // Reads the value from bytes that need not be trusted, never past `end`, and moves the cursor
+    // behind it. False for what is no value, and when memory has run out: the value is nil then,
+    // and the cursor stays.
+    bool FromPkt(RemoteApp* app, unsigned char*& cursor, const unsigned char* end);
+
+    // Packets; null as CreatePkt tells. A call of an object's member, by an opcode or a kind of
+    // symbol, with its arguments as the second value.
+    static Packet* ToPacket(RemoteApp* app, uint32_t target, int symbol, const ScriptVal* first,
+                            const ScriptVal* second);
+    static Packet* ToPacket(RemoteObject* object, int symbol, const ScriptVal* first,
+                            const ScriptVal* second);
+    // The reply to a call, with the results of `args` and its error, if it has one; a null `args`
+    // has no results. Results that no packet can take become the error "Packet too large.".
+    static Packet* ToReply(RemoteApp* app, uint32_t context, const ScriptVal* first,
+                           ScriptVal* args);
+    static Packet* ToReply(RemoteObject* object, Packet* request, const ScriptVal* first,
+                           ScriptVal* args);
+    // Reads both values; a null destination throws one away, an args list keeps its context. The
+    // error of a reply becomes the connection's last one. False, with nothing changed, when these
+    // are not just two values.
+    static bool FromPacket(RemoteApp* app, Packet* packet, ScriptVal* first, ScriptVal* second);
+    static bool FromPacket(RemoteObject* object, Packet* packet, ScriptVal* first,
+                           ScriptVal* second);
 
     // Calls. The connection of a proxy or args list, borrowed, else null; SetApp is for args only.
     RemoteApp* GetApp() const;

@@ -11,6 +11,7 @@
 #include "core/ReusePoolInternal.h"
 #include "core/ScriptVal.h"
 #include "core/TextCellInternal.h"
+#include "core/TextProbeInternal.h"
 
 // What the sources of ScriptVal share: text payloads, chains of entries, walks without recursion.
 namespace Korvel {
@@ -32,6 +33,14 @@ bool SendCommand(ScriptVal proxy, int opcode, ScriptArgs& args, ScriptVal& reply
 inline bool IsLostCopy(const ScriptVal& copy, const ScriptVal& original) {
     if (!copy.IsNil() || original.IsNil()) return false;
     return !original.IsLocalObject(true) || original.ToLocalObject();
+}
+
+// Makes a nil the string of a cell, which it takes over; the length is the one up to the NUL.
+inline void AdoptText(ScriptVal& value, uint32_t flags, const char* cell, size_t length) {
+    const char* text = cell + 1;
+    value.m_Flags = flags;
+    value.m_Value.m_String = {const_cast<char*>(cell), GetHashValue(text, static_cast<int>(length)),
+                              GetTextProbe(text, length)};
 }
 
 // Entries are made and freed so often that both are done in line. Null without memory.

@@ -21,8 +21,6 @@ class TagList;
 // function `table.ordered`, without which it becomes a plain one, and read by the iterator
 // `_orderedtable_next`. These three are looked up as they stand, past any metatable.
 
-constexpr int kMaxNesting = 256;
-
 // Converts a value itself when it returns true: leaves one value on top of the stack, or sets
 // `value`. The callbacks of the configuration are asked after it, for keys too.
 using ToLuaFunc = bool (*)(RemoteApp* app, lua_State* L, ScriptVal& value, void* user);
