@@ -16,7 +16,6 @@ enum : int { kFailed = -1, kNotLoaded = -2 };
 struct ScriptRun {
     const char* m_File;
     char** m_Argv;
-    lua_CFunction m_Handler;
     int m_Result;
 };
 
@@ -46,7 +45,7 @@ int LoadAndCall(lua_State* L) {
     ScriptRun& run = *static_cast<ScriptRun*>(lua_touserdata(L, 1));
     OpenAllLibs(L);
     SetArgs(L, run.m_Argv, 1);
-    lua_pushcfunction(L, run.m_Handler);
+    lua_pushcfunction(L, l_alert);
     if (luaL_loadfile(L, run.m_File) != 0) {
         run.m_Result = kNotLoaded;
         lua_call(L, 1, 0);
@@ -60,8 +59,10 @@ int LoadAndCall(lua_State* L) {
 }
 
 }  // namespace
+}  // namespace Korvel
 
-int RunScriptWith(const char* file, char** argv, lua_CFunction handler) {
+extern "C" int RunScript(const char* file, char** argv) {
+    using namespace Korvel;
     if (!file) {  // for the interpreter it would mean standard input
         WriteLine("no script file given");
         return kNotLoaded;
@@ -71,14 +72,8 @@ int RunScriptWith(const char* file, char** argv, lua_CFunction handler) {
         WriteLine("not enough memory for an interpreter");
         return kFailed;
     }
-    ScriptRun run{file, argv, handler, kFailed};
+    ScriptRun run{file, argv, kFailed};
     if (lua_cpcall(L, LoadAndCall, &run) != 0) WriteLine(MessageAt(L, -1));
     CloseInterpreter(L);
     return run.m_Result;
-}
-
-}  // namespace Korvel
-
-extern "C" int RunScript(const char* file, char** argv) {
-    return Korvel::RunScriptWith(file, argv, Korvel::l_alert);
 }

@@ -2,8 +2,6 @@
 
 #include "core/Export.h"
 
-struct lua_State;
-
 extern "C" {
 
 // Runs a Lua file in a fresh interpreter with all libraries and the arguments `argv` (texts up to a
@@ -13,11 +11,3 @@ extern "C" {
 KORVEL_EXPORT int RunScript(const char* file, char** argv);
 
 }  // extern "C"
-
-namespace Korvel {
-
-// The same with a message handler of the caller's: it gets each error's message as its argument, on
-// the stack of the failing script, or behind a file that could not be loaded.
-KORVEL_EXPORT int RunScriptWith(const char* file, char** argv, int (*handler)(lua_State*));
-
-}  // namespace Korvel
