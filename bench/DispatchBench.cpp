@@ -114,6 +114,17 @@ void CallAlone(benchmark::State& state) {
     for (auto _ : state) symbol->Call(&object, args, false);
 }
 
+// The same through the function value that a script holds.
+void FunctionValue(benchmark::State& state) {
+    Derived object;
+    ScriptInfo* info = object.GetScriptInfo();
+    auto address = reinterpret_cast<uint64_t>(info->FindSymbol("Nothing", 0));
+    ScriptArgs args;
+    args[0] = ScriptVal(SV_Function, &address);
+    ScriptSymbol* symbol = info->FindSymbol(nullptr, SST_CallFunction);
+    for (auto _ : state) symbol->Call(&object, args, false);
+}
+
 const char* const s_Own = "Add";
 const char* const s_Inherited = "AddToBase";
 
@@ -188,6 +199,7 @@ int main(int argc, char** argv) {
     benchmark::RegisterBenchmark("  of it, look-up, inherited@korvelscript", LookUp<s_Inherited>);
     benchmark::RegisterBenchmark("  of it, values@korvelscript", Values);
     benchmark::RegisterBenchmark("  of it, call@korvelscript", CallAlone);
+    benchmark::RegisterBenchmark("call of a function value@korvelscript", FunctionValue);
     int status = Korvel::Bench::RunComparison(argc, argv);
     if (status == 0) CountHeapCalls();
     return status;

@@ -26,6 +26,13 @@ inline int FutexWait(FutexWord& word, uint32_t seen, const timespec* deadline = 
     return result == 0 ? 0 : errno;
 }
 
+// The same with a deadline on the clock that nobody sets.
+inline int FutexWaitSteady(FutexWord& word, uint32_t seen, const timespec* deadline) {
+    constexpr int kWait = FUTEX_WAIT_BITSET | FUTEX_PRIVATE_FLAG;
+    long result = syscall(SYS_futex, &word, kWait, seen, deadline, nullptr, FUTEX_BITSET_MATCH_ANY);
+    return result == 0 ? 0 : errno;
+}
+
 // Wakes at most `count` threads. It only uses the address, so the word may be gone already.
 inline void FutexWake(const void* word, int count) {
     syscall(SYS_futex, word, FUTEX_WAKE_PRIVATE, count, nullptr, nullptr, 0);

@@ -2,6 +2,7 @@
 
 #include "Platform/Events.h"
 #include "Platform/Mutex.h"
+#include "core/SpinLockInternal.h"
 
 namespace Korvel::KorvelScript {
 
@@ -11,6 +12,7 @@ Lock::~Lock() {
 }
 
 bool Lock::ObtainLock() {
+    LockPlace::AssertMoreMayCome();
     return Platform::ObtainMutex(m_Mutex, Platform::kNoTimeLimit);
 }
 bool Lock::TryObtainLock() {

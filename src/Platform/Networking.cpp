@@ -181,6 +181,12 @@ unsigned int SocketSend(_Socket* socket, const void* data, int length) {
     });
 }
 
+unsigned int SocketSendMore(_Socket* socket, const void* data, int length) {
+    return Transfer(length, [&](size_t size) {
+        return send(SocketDescriptor(socket), data, size, MSG_NOSIGNAL | MSG_MORE);
+    });
+}
+
 unsigned int SocketReceive(_Socket* socket, void* data, int length, unsigned int* port,
                            unsigned int* ip) {
     if (!port || !ip) {
@@ -263,6 +269,26 @@ bool SetSocketExclusiveAddress(_Socket* socket, bool on) {
 }
 bool SetSocketFastLoopback(_Socket* socket, bool on) {
     return false;
+}
+
+bool SetSocketKeepAlive(_Socket* socket, int idleSeconds, int intervalSeconds, int count) {
+    return SetOption(socket, IPPROTO_TCP, TCP_KEEPIDLE, idleSeconds) &&
+           SetOption(socket, IPPROTO_TCP, TCP_KEEPINTVL, intervalSeconds) &&
+           SetOption(socket, IPPROTO_TCP, TCP_KEEPCNT, count) &&
+           SetFlag(socket, SOL_SOCKET, SO_KEEPALIVE, true);
+}
+
+bool SetSocketReadThreshold(_Socket* socket, int bytes) {
+    return SetOption(socket, SOL_SOCKET, SO_RCVLOWAT, bytes);
+}
+
+bool GetSocketSilence(_Socket* socket, SocketSilence& silence) {
+    tcp_info info = {};
+    socklen_t size = sizeof(info);
+    if (getsockopt(SocketDescriptor(socket), IPPROTO_TCP, TCP_INFO, &info, &size) != 0)
+        return false;
+    silence = {info.tcpi_last_ack_recv, info.tcpi_unacked > 0 || info.tcpi_probes > 0};
+    return true;
 }
 
 bool ShutdownSocket(_Socket* socket, unsigned int how) {

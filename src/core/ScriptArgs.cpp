@@ -60,11 +60,6 @@ bool ScriptVal::QueueAction(const char* action, const ScriptVal& args) {
     return true;
 }
 
-// Somebody waits for the reply.
-static bool HasCaller(const ScriptArgs& args) {
-    return args.IsArgs() && args.m_Value.m_Args.m_App && args.m_Value.m_Args.m_Context != 0;
-}
-
 ScriptVal& ScriptArgs::Return() {
     if (!IsArgs()) return InvalidValue();
     uint8_t count = ++m_Value.m_Args.m_NumReturns;
@@ -116,7 +111,8 @@ bool ScriptArgs::SetArguments(const ScriptVal* const* values, int count) {
 }
 
 ScriptArgs* ScriptArgs::DeferReply() {
-    if (!HasCaller(*this) || (m_Flags & SVF_ReplyDeferred)) return nullptr;
+    bool hasCaller = IsArgs() && GetApp() && m_Value.m_Args.m_Context != 0;
+    if (!hasCaller || (m_Flags & SVF_ReplyDeferred)) return nullptr;
     auto* later = new ScriptArgs();
     if (!later) return nullptr;
     later->m_Flags = m_Flags & ~SVF_ReadOnly;
@@ -128,7 +124,7 @@ ScriptArgs* ScriptArgs::DeferReply() {
 }
 
 bool ScriptArgs::SendReply() {
-    return HasCaller(*this) && g_ScriptHooks.m_SendReply(*this);
+    return IsArgs() && GetApp() && g_ScriptHooks.m_SendReply(*this);
 }
 
 }  // namespace Korvel

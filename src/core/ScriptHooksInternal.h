@@ -37,6 +37,9 @@ struct ScriptHooks {
     // Sends the list as the reply to its call.
     bool (*m_SendReply)(ScriptArgs&) = [](ScriptArgs&) { return false; };
 
+    // The calling thread begins or ends a wait for the UI thread.
+    void (*m_SetWaitingForUI)(bool isWaiting) = [](bool) {};
+
     // Takes an object that goes away out of the tables of exported objects. Called with no lock
     // held. The result is ClearObjectReferences' own.
     bool (*m_ForgetExports)(ScriptObject*, bool dropCounts) = [](ScriptObject*, bool) {

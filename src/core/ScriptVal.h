@@ -52,10 +52,12 @@ constexpr uint32_t SVF_Foreign = 0x100000;        // local object: neither adds 
 constexpr uint32_t SVF_ExplicitKeys = 0x100000;   // table: number keys are always written out
 constexpr uint32_t SVF_Ordered = 0x200000;        // table: the order of keys matters
 constexpr uint32_t SVF_List = 0x400000;           // table: built from a list
+constexpr uint32_t SVF_TableResult = 0x100000;    // function: its results are packed into a table
+constexpr uint32_t SVF_AnyThreadFunc = 0x400000;  // function: runs on its caller's thread
 constexpr uint32_t SVF_ReplyDeferred = 0x200000;  // args: the reply comes later
 constexpr uint32_t SVF_CallDelay = 0x800000;      // args: this call is paced
 constexpr uint32_t SVF_ForceDelay = 0x1000000;    // args: the reply of this call waits 500 ms
-constexpr uint32_t SVF_FromWire = 0x80000000;     // args: came in a packet
+constexpr uint32_t SVF_FromWire = 0x80000000;     // args: what they cause is printed
 constexpr uint32_t SVF_ForeignCode = 0x100000;    // code: came from another process
 
 // How many tables and args lists may stand one in another where values come from outside or leave
@@ -465,8 +467,8 @@ public:
     static ScriptVal CreateUUID();
     static void CreateUUID(ScriptVal& value);
 
-    // The wire form (docs/protocol.md). Objects are counted on the connection; without one, or on
-    // one that is closed, they go out without a number, and come in as nil. Defined with the
+    // The wire form (docs/protocol.md). Objects are counted on the connection. Without one they
+    // come in as nil, and without one that is open they go out without a number. Defined with the
     // connections.
 
     // The bytes that ToPkt writes; 0 for a value that nests deeper than kMaxNesting or would take
@@ -545,7 +547,8 @@ public:
         RemoteApp* m_App;
         uint32_t m_Context;
         uint8_t m_NumReturns;
-        uint8_t m_pad[3];
+        uint8_t m_pad;
+        uint16_t m_Run;  // of the connection; 0 for any
     };
     struct BlockPayload {
         void* m_Ptr;

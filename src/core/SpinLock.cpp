@@ -4,11 +4,13 @@
 
 #include "Platform/NoKillInternal.h"
 #include "Platform/Threads.h"
+#include "core/SpinLockInternal.h"
 
 namespace Korvel {
 
 void NestedSpinLock::ObtainLock() {
     using Platform::AddNoKillDepth;
+    LockPlace::AssertMoreMayCome();
     uint64_t self = Platform::GetCurrentThreadID();
     AddNoKillDepth(1);  // until ReleaseLock
     if (m_Owner.load(std::memory_order_relaxed) != self) {

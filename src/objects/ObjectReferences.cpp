@@ -12,7 +12,7 @@
 #include "core/0ReusePool.h"
 #include "core/Annotations.h"
 #include "core/ScriptHooksInternal.h"
-#include "core/SpinLock.h"
+#include "core/SpinLockInternal.h"
 #include "objects/ScriptObject.h"
 
 namespace Korvel {
@@ -34,7 +34,7 @@ constinit Entry** s_ObjRefMap = s_FirstChains;
 constinit Entry** s_RefObjMap = s_FirstChains + kFirstSize;  // in one block with the other
 constinit size_t s_EntryCount = 0;
 
-constinit SpinLock s_ObjRefMapLock;
+constinit SpinLock s_ObjRefMapLock;                // LockRank::Last
 constinit std::atomic<size_t> s_Size{kFirstSize};  // written under the lock
 constinit std::atomic<uint64_t> s_NextObjRef{1};
 
@@ -102,7 +102,7 @@ void Grow() {
     if (!chains) return;
     memset(chains, 0, bytes);
     {
-        AutoSpinLock lock(s_ObjRefMapLock);
+        AutoPlacedLock lock(LockRank::Last, s_ObjRefMapLock);
         // Another thread may have been first: then the new block is the one that goes.
         if (s_Size.load(std::memory_order_relaxed) < size) chains = RehashLocked(chains, size);
     }
@@ -113,15 +113,13 @@ void Grow() {
 
 uint64_t ObjectReferences::GetObjectReference(const ScriptObject* object) {
     if (!object) return 0;
-    Platform::NoKill noKill;
-    AutoSpinLock lock(s_ObjRefMapLock);
+    AutoPlacedLock lock(LockRank::Last, s_ObjRefMapLock);
     Entry* entry = FindLocked(object);
     return entry ? entry->m_Ref : 0;
 }
 
 ScriptObject* ObjectReferences::GetReferenceObject(unsigned long long ref) {
-    Platform::NoKill noKill;
-    AutoSpinLock lock(s_ObjRefMapLock);
+    AutoPlacedLock lock(LockRank::Last, s_ObjRefMapLock);
     Entry* entry = FindLocked(uint64_t{ref});
     return entry ? const_cast<ScriptObject*>(entry->m_Object) : nullptr;
 }
@@ -137,7 +135,7 @@ uint64_t ObjectReferences::AddObjectReference(const ScriptObject* object) {
     uint64_t ref;
     bool isFull = false;
     {
-        AutoSpinLock lock(s_ObjRefMapLock);
+        AutoPlacedLock lock(LockRank::Last, s_ObjRefMapLock);
         if (Entry* known = FindLocked(object)) {
             ref = known->m_Ref;
         } else {
@@ -160,7 +158,7 @@ bool ObjectReferences::ClearObjectReferences(ScriptObject* object, bool dropCoun
         Platform::NoKill noKill;
         Entry* entry;
         {
-            AutoSpinLock lock(s_ObjRefMapLock);
+            AutoPlacedLock lock(LockRank::Last, s_ObjRefMapLock);
             entry = FindLocked(object);
             if (entry) {
                 UnlinkLocked(entry);

@@ -81,8 +81,15 @@ private:                            \
                    ::Korvel::SST_Constant | (Flags), __VA_ARGS__)
 
 // The opcode's name, such as SST_Call, stands in place of a member's.
-#define KORVEL_OPCODE(Class, Opcode, Flags, ...) \
+#define KORVEL_OPCODE(Class, Opcode, Flags, ...)                                                   \
+    static_assert(::Korvel::Opcode != ::Korvel::SST_Create, "KORVEL_CREATE publishes SST_Create"); \
     KORVEL_MEMBER_(Class, Class, Opcode, nullptr, ::Korvel::Opcode | (Flags), __VA_ARGS__)
+
+// SST_Create, which makes an object of the class. Scripts get it from any object by the name of the
+// class, and may call it on that: so `self` is a ScriptObject of any class.
+#define KORVEL_CREATE(Class, Flags, ...)                               \
+    KORVEL_MEMBER_(Class, ::Korvel::ScriptObject, SST_Create, nullptr, \
+                   ::Korvel::SST_Create | (Flags), __VA_ARGS__)
 
 // A topic of the help. It has no body.
 #define KORVEL_HELP(Class, Topic, ...)                               \

@@ -36,4 +36,9 @@ bool IsDebugMode() {
     return config && config->IsDebugMode && config->IsDebugMode(config->m_UserData, nullptr);
 }
 
+ScriptObject* GetAppObject() {
+    ScriptConfig* config = g_ScriptConfig.load(std::memory_order_acquire);
+    return config && config->GetApp ? config->GetApp(config->m_UserData, nullptr) : nullptr;
+}
+
 }  // namespace Korvel

@@ -34,9 +34,9 @@ struct ScriptConfig {
 
     uint32_t m_Version = 1;
     uint32_t m_Flags = SCF_Standard;
-    const char* m_AppName = nullptr;  // as peers and the script server see it
-    void* m_UserData = nullptr;       // passed to the callbacks
-    bool m_Active = false;            // the library's: requests go through UIExecute
+    const char* m_AppName = nullptr;    // as peers and the script server see it
+    void* m_UserData = nullptr;         // passed to the callbacks
+    std::atomic<bool> m_Active{false};  // the library's: requests go through UIExecute
 
     // Whether members for debug mode are there. Null is no.
     bool (*IsDebugMode)(void* userData, TagList* tags) = nullptr;
@@ -74,7 +74,8 @@ KORVEL_EXPORT unsigned long long GetGUIThread();
 KORVEL_EXPORT void SetGUIThread(unsigned long long threadID);
 KORVEL_EXPORT bool IsGUIThread();
 
-// Asks the configuration; false without one.
+// Ask the configuration; false or null without one.
 KORVEL_EXPORT bool IsDebugMode();
+KORVEL_EXPORT ScriptObject* GetAppObject();  // borrowed
 
 }  // namespace Korvel

@@ -18,7 +18,9 @@
 #include "core/SpinLock.h"
 #include "core/TagList.h"
 #include "core/TextProbeInternal.h"
+#include "objects/LiveSymbolsInternal.h"
 #include "objects/ScriptConfig.h"
+#include "objects/ScriptHelpInternal.h"
 
 namespace Korvel {
 
@@ -111,19 +113,9 @@ struct ScriptInfoAccess {
         info.m_Parent.store(parent ? parent : &GetRootScriptInfo(), std::memory_order_release);
         MoveConstants(info);
     }
-
-    static void MakeRoot(ScriptInfo& info) { info.m_Parent = nullptr; }
 };
 
 namespace {
-
-struct RootInfo : ScriptInfoT<ScriptObject> {
-    RootInfo() : ScriptInfoT(1, "", "", "") { ScriptInfoAccess::MakeRoot(*this); }
-};
-
-// Constructed before, and destroyed after, the records of hosts, which come to its list; where the
-// library is linked as an archive, theirs may stand ahead of all else in this one.
-__attribute__((init_priority(102))) RootInfo __ScriptInfo_ScriptObject;
 
 // A name to look for. The walk compares probes and hardly ever touches texts.
 class NameToFind {
@@ -166,10 +158,6 @@ const char* OrEmpty(const char* text) {
 }
 
 }  // namespace
-
-ScriptInfo& GetRootScriptInfo() {
-    return __ScriptInfo_ScriptObject;
-}
 
 void ObtainSSILock() {
     g_SSILock.ObtainLock();
@@ -215,14 +203,19 @@ ScriptSymbol* ScriptInfo::FindSymbol(const char* name, unsigned int kind) const 
             if (symbol.m_NameProbe != wanted.GetProbe()) continue;
             if (symbol.GetKind() != kind && (kind != 0 || !name)) continue;
             if (!wanted.IsText(symbol.m_Name)) continue;
-            if ((symbol.m_Flags & SSF_Debug) && !IsDebugMode()) continue;
+            if (!symbol.IsPresent()) continue;
             return &symbol;
         }
     }
     return nullptr;
 }
 
-ScriptSymbol::ScriptSymbol() : m_ShortHelp(""), m_NextCallTime(Platform::GetUpTime()) {}
+ScriptSymbol::ScriptSymbol()
+    : m_ShortHelp(""), m_LongHelp(""), m_NextCallTime(Platform::GetUpTime()) {}
+
+bool ScriptSymbol::IsPresent() const {
+    return !(m_Flags & SSF_Debug) || IsDebugMode();
+}
 
 ScriptSymbol::~ScriptSymbol() {
     Leave();
@@ -234,8 +227,7 @@ void ScriptSymbol::Init(unsigned int version, const char* name, unsigned int fla
     Leave();
     TagList* tags = new TagList;
     if (tags && help) tags->SetTags(help, true);
-    SetHelp(tags);
-    Enter(version, name, flags, info);
+    Enter(version, name, flags, info, tags);
 }
 
 void ScriptSymbol::Init(unsigned int version, const char* name, unsigned int flags,
@@ -250,11 +242,10 @@ void ScriptSymbol::Init(unsigned int version, const char* name, unsigned int fla
             tags->Set(tag.m_Tag, tag.m_Bool, true);
         }
     }
-    SetHelp(tags);
-    Enter(version, name, flags, info);
+    Enter(version, name, flags, info, tags);
 }
 
-// Takes the list over.
+// Takes the list over. The other fields are set.
 void ScriptSymbol::SetHelp(TagList* tags) {
     TagList* old = std::exchange(m_Tags, tags);
     m_AttrName = nullptr;
@@ -264,17 +255,21 @@ void ScriptSymbol::SetHelp(TagList* tags) {
         m_AttrName = tags->GetString(SYMT_AttrName, nullptr);
         m_ShortHelp.Set(tags->GetString(SYMT_ShortHelp, ""), true);
     }
+    m_LongHelp = ComposeLongHelp(*this);
     delete old;
 }
 
 void ScriptSymbol::Enter(unsigned int version, const char* name, unsigned int flags,
-                         ScriptInfo& info) {
+                         ScriptInfo& info, TagList* help) {
     m_Version = version;
     m_Name.Set(name, true);
     m_NameProbe = NameToFind(m_Name).GetProbe();
     m_Flags = flags;
     m_Info = &info;
+    SetHelp(help);
 
+    m_IsEntered = true;
+    LiveSymbols::Add(*this);  // first: who finds it may call it
     AutoNestedSpinLock lock(g_SSILock);
     if (GetKind() >= SST_FirstOpcode) {
         info.m_Opcodes[GetKind() - SST_FirstOpcode].store(this, std::memory_order_release);
@@ -285,16 +280,24 @@ void ScriptSymbol::Enter(unsigned int version, const char* name, unsigned int fl
     }
 }
 
+// Leaves the fields alone, which a call under way may read.
 void ScriptSymbol::Leave() {
-    if (!m_Info) return;
-    AutoNestedSpinLock lock(g_SSILock);
-    if (GetKind() >= SST_FirstOpcode) {
-        ScriptSymbol* self = this;
-        m_Info->m_Opcodes[GetKind() - SST_FirstOpcode].compare_exchange_strong(self, nullptr);
-    } else if (!ScriptInfoAccess::Unlink(*m_Info, *this)) {
-        ScriptInfoAccess::Unlink(GetRootScriptInfo(), *this);
+    if (!std::exchange(m_IsEntered, false)) return;
+    {
+        AutoNestedSpinLock lock(g_SSILock);
+        if (GetKind() >= SST_FirstOpcode) {
+            ScriptSymbol* self = this;
+            m_Info->m_Opcodes[GetKind() - SST_FirstOpcode].compare_exchange_strong(self, nullptr);
+        } else if (!ScriptInfoAccess::Unlink(*m_Info, *this)) {
+            ScriptInfoAccess::Unlink(GetRootScriptInfo(), *this);
+        }
     }
-    m_Info = nullptr;
+    LiveSymbols::Remove(*this);
+}
+
+bool ScriptSymbol::Withdraw() {
+    Leave();
+    return m_Holds.load(std::memory_order_acquire) == 0;
 }
 
 namespace {
@@ -306,7 +309,9 @@ bool RunOnGUIThread(ScriptConfig::UIFunction function, void* call) {
     if (IsGUIThread()) return false;
     ScriptConfig* config = g_ScriptConfig.load(std::memory_order_acquire);
     if (config && config->UIExecute) {
+        g_ScriptHooks.m_SetWaitingForUI(true);
         config->UIExecute(function, call, nullptr, true);
+        g_ScriptHooks.m_SetWaitingForUI(false);
         return true;
     }
     static constinit std::atomic<bool> s_IsTold{false};
@@ -371,23 +376,6 @@ void _InitScriptInfo(ScriptInfo& info, ScriptInfo* parent) {
     if (info.IsParentKnown()) return;
     AutoNestedSpinLock lock(g_SSILock);
     ScriptInfoAccess::SetParent(info, parent);
-}
-
-bool CallScriptFunc(ScriptObject* object, const char* name, ScriptArgs& args, TagList*) {
-    ScriptInfo* info = object ? object->GetScriptInfo() : nullptr;
-    ScriptSymbol* getTable = info ? info->FindSymbol(nullptr, SST_GetTable) : nullptr;
-    if (!getTable) return false;
-    ScriptArgs lookUp;
-    lookUp.SetApp(args.GetApp());
-    if (!lookUp.SetPosition(0, name)) return false;
-    getTable->Call(object, lookUp, false);
-    const ScriptVal& function = std::as_const(lookUp)[-1];
-    if (!function.IsFunction()) return false;
-    ScriptSymbol* callFunction = info->FindSymbol(nullptr, SST_CallFunction);
-    if (!callFunction) return false;
-    if (!args.SetPosition(0, function)) return false;
-    callFunction->Call(object, args, false);
-    return true;
 }
 
 }  // namespace Korvel

@@ -195,6 +195,9 @@ public:
         return m_Opcodes[opcode % kOpcodeSlots].load(std::memory_order_acquire);
     }
 
+protected:
+    void BecomeRoot() { m_Parent = nullptr; }  // for the root's constructor
+
 private:
     friend class ScriptSymbol;
     friend class SymbolRange;
@@ -281,11 +284,17 @@ public:
     // Callers in this process need not heed it.
     void Call(ScriptObject* object, ScriptArgs& args, bool set);
 
+    // For a symbol made at run time, before it is deleted: takes it from its class, so that neither
+    // a look-up nor a function value leads to it any more. Init would put it back. False while a
+    // call that a function value has led to is under way; then ask again.
+    bool Withdraw();
+
     uint32_t GetVersion() const { return m_Version; }
     ScriptInfo* GetInfo() const { return m_Info; }
     const OxID& GetName() const { return m_Name; }
     uint32_t GetFlags() const { return m_Flags; }
     uint32_t GetKind() const { return m_Flags & SST_KindMask; }
+    bool IsPresent() const;  // false for a member for debug mode outside of it
     const OxID& GetShortHelp() const { return m_ShortHelp; }
     const OxID& GetLongHelp() const { return m_LongHelp; }
     TagList* GetHelpTags() const { return m_Tags; }         // borrowed; null without memory or Init
@@ -294,6 +303,7 @@ public:
 private:
     friend class ScriptInfo;
     friend class SymbolRange;
+    friend struct LiveSymbolsAccess;
     friend struct ScriptInfoAccess;
 
     struct CallArgs;
@@ -301,7 +311,8 @@ private:
     void Run(ScriptObject* object, ScriptArgs& args, bool set);
     unsigned long long TakeTurn();
     void SetHelp(TagList* help);
-    void Enter(unsigned int version, const char* name, unsigned int flags, ScriptInfo& info);
+    void Enter(unsigned int version, const char* name, unsigned int flags, ScriptInfo& info,
+               TagList* help);
     void Leave();
 
     // The order of the fields is a contract. Fixed after Init, but for what is atomic; links are
@@ -318,6 +329,9 @@ private:
     const char* m_AttrName = nullptr;
     std::atomic<unsigned long long> m_NextCallTime;  // milliseconds of Platform::GetUpTime
     std::atomic<ScriptSymbol*> m_RootNext{nullptr};  // a constant's, on the list of the root
+    ScriptSymbol* m_NextLive = nullptr;              // LiveSymbols' own
+    bool m_IsEntered = false;                        // stands on its record
+    std::atomic<uint32_t> m_Holds{0};                // calls that function values have led to
 };
 
 // A member that a member function of T, or of a class of its own shape, serves; a virtual one is

@@ -63,7 +63,8 @@ TEST(Thread, RunsItsBodyOnceEachStart) {
         Await([&] { return !worker.IsRunning() && !worker.GetThread(); });
     }
     go.Signal();
-    Await([&] { return worker.Start() != nullptr; });  // destroyed while it runs
+    Await([&] { return worker.Start() != nullptr; });
+    EXPECT_TRUE(done.Wait(kLong));  // destroyed while it runs
 }
 
 // From before the body begins to after its end: whatever the moment, nothing is touched afterwards.
