@@ -1,7 +1,8 @@
 // What it takes to pass an object to a peer that already knows others: the count of the exporter,
-// its look-up for a call, and the count of the peer's proxy, there and back. With many objects and
-// with few, and beside hash maps under a mutex that only count.
+// its look-up for a call, and the count of the peer's proxy, there and back; then the same within
+// packets. With many objects and with few, and beside hash maps under a mutex that only count.
 #include <cstdint>
+#include <cstdlib>
 #include <memory>
 #include <mutex>
 #include <unordered_map>
@@ -29,7 +30,7 @@ public:
     void Disconnect() override {}
     void End() {
         m_IsOpen = false;
-        CleanUpReferences();
+        Cleanup(GetRun());
     }
 
 private:
@@ -57,10 +58,28 @@ public:
         record->DecRef();
     }
 
-private:
+protected:
     std::vector<std::unique_ptr<_Object>> m_Objects;
     std::vector<uint32_t> m_IDs;
     OpenApp m_Exporter, m_Reader;
+};
+
+class Packets : public Connection {
+public:
+    using Connection::Connection;
+    void Pass(size_t i) {
+        ScriptVal value(m_Objects[i].get());
+        Carry(m_Exporter, m_Reader, value);
+        Carry(m_Reader, m_Exporter, value);
+        if (value.ToLocalObject() != m_Objects[i].get()) abort();
+    }
+
+private:
+    static void Carry(RemoteApp& from, RemoteApp& to, ScriptVal& value) {
+        Packet* packet = CreatePkt(PKT_Script, &from, nullptr, &value);
+        ScriptVal::FromPacket(&to, packet, nullptr, &value);
+        FreePkt(packet);
+    }
 };
 
 class Maps {
@@ -119,6 +138,10 @@ BENCHMARK_TEMPLATE(Pass, Maps, kMany, 0)->Name("one of them@maps of 100000");
 BENCHMARK_TEMPLATE(Pass, Connection, kMany, kStep)->Name("all in turn@100000 exported");
 BENCHMARK_TEMPLATE(Pass, Connection, kFew, kStep)->Name("all in turn@10 exported");
 BENCHMARK_TEMPLATE(Pass, Maps, kMany, kStep)->Name("all in turn@maps of 100000");
+BENCHMARK_TEMPLATE(Pass, Packets, kMany, 0)->Name("one of them, in packets@100000 exported");
+BENCHMARK_TEMPLATE(Pass, Packets, kFew, 0)->Name("one of them, in packets@10 exported");
+BENCHMARK_TEMPLATE(Pass, Packets, kMany, kStep)->Name("all in turn, in packets@100000 exported");
+BENCHMARK_TEMPLATE(Pass, Packets, kFew, kStep)->Name("all in turn, in packets@10 exported");
 
 }  // namespace
 

@@ -33,9 +33,11 @@ set(KORVEL_PUBLIC_HEADERS
     objects/ScriptConfig.h
     objects/ScriptObject.h
     objects/ScriptSymbol.h
+    remote/ConnectApp.h
     remote/Packets.h
     remote/RemoteApp.h
     remote/RemoteObject.h
+    remote/ScriptApp.h
     remote/ScriptPort.h
     runtime/Script.h
     runtime/ScriptDebug.h

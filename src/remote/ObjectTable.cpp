@@ -1,6 +1,7 @@
 #include <sys/random.h>
 
 #include <bit>
+#include <cassert>
 #include <cstring>
 #include <utility>
 
@@ -8,116 +9,130 @@
 
 namespace Korvel {
 
-// The upper half of the product depends on all bits of the key.
-uint32_t ObjectTable::Hash(uint64_t key) const {
-    return static_cast<uint32_t>(key * m_Factor >> 32) >> (32 - std::countr_zero(m_Size));
+// Doubles the index when it is three quarters full. Without memory it goes on until one slot is
+// left, where searches end.
+bool PlaceIndex::Reserve() {
+    uint32_t size = 1u << m_Bits;
+    if (m_Count < size / 4 * 3) return true;
+    bool isFull = m_Count + 1 >= size;
+    if (m_Bits >= 31) return !isFull;
+    size_t bytes = size_t{2} * size * sizeof(Slot);
+    auto* slots = static_cast<Slot*>(g_ReusePoolMgr.Alloc(bytes));
+    if (!slots) return !isFull;
+    memset(slots, 0, bytes);
+    Slot* old = std::exchange(m_Slots, slots);
+    m_Bits++;
+    m_Count = 0;
+    for (uint32_t i = 0; i < size; i++) {
+        if (old[i].m_Place) Add(old[i].m_Hash, old[i].m_Place);
+    }
+    if (old != m_FirstSlots) g_ReusePoolMgr.Free(old);
+    return true;
 }
-ObjectRecord** ObjectTable::BucketOf(uint64_t id) const {
-    return &m_Buckets[Hash(id)];
+
+void PlaceIndex::Add(uint32_t hash, uint32_t place) {
+    m_Slots[FindSlot(hash, [](uint32_t) { return false; })] = {hash, place};
+    m_Count++;
 }
-ObjectRecord** ObjectTable::BucketOf(const ScriptObject* object) const {
-    return &m_Buckets[m_Size + Hash(reinterpret_cast<uintptr_t>(object) >> 4)];
+
+// What comes behind moves up as far as it may, so that no search ends too early.
+void PlaceIndex::Remove(uint32_t hash, uint32_t place) {
+    uint32_t hole = FindSlot(hash, [place](uint32_t at) { return at == place; });
+    assert(m_Slots[hole].m_Place == place);
+    uint32_t mask = Mask();
+    for (uint32_t i = (hole + 1) & mask; m_Slots[i].m_Place; i = (i + 1) & mask) {
+        uint32_t way = (i - HomeOf(m_Slots[i].m_Hash)) & mask;
+        if (way >= ((i - hole) & mask)) m_Slots[std::exchange(hole, i)] = m_Slots[i];
+    }
+    m_Slots[hole] = {};
+    m_Count--;
+}
+
+void PlaceIndex::Clear() {
+    if (m_Slots != m_FirstSlots) g_ReusePoolMgr.Free(m_Slots);
+    m_Slots = m_FirstSlots;
+    memset(m_FirstSlots, 0, sizeof m_FirstSlots);
+    m_Bits = kFirstBits;
+    m_Count = 0;
 }
 
 ObjectRecord* ObjectTable::Find(uint64_t id) const {
-    ObjectRecord* record = *BucketOf(id);
-    while (record && record->m_ID != id) record = record->m_NextByID;
-    return record;
-}
-
-ObjectRecord* ObjectTable::Find(const ScriptObject* object) const {
-    if (!object) return nullptr;
-    ObjectRecord* record = *BucketOf(object);
-    while (record && record->m_Object != object) record = record->m_NextByObject;
-    return record;
-}
-
-ObjectRecord* ObjectTable::FindNext(const ObjectRecord* record) {
-    ObjectRecord* next = record->m_NextByObject;
-    while (next && next->m_Object != record->m_Object) next = next->m_NextByObject;
-    return next;
-}
-
-ObjectRecord* ObjectTable::Find(const ScriptObject* object, uint32_t id) const {
-    ObjectRecord* record = Find(object);
-    while (record && record->m_ID != id) record = FindNext(record);
-    return record;
-}
-
-void ObjectTable::Link(ObjectRecord* record) {
-    ObjectRecord** byID = BucketOf(record->m_ID);
-    record->m_NextByID = std::exchange(*byID, record);
-    if (!HasAddress(record)) return;
-    ObjectRecord** byObject = BucketOf(record->m_Object);
-    record->m_NextByObject = std::exchange(*byObject, record);
+    if (id > UINT32_MAX) return nullptr;
+    uint32_t place = m_ByID.Find(HashOf(static_cast<uint32_t>(id)), [](uint32_t) { return true; });
+    return place ? At(place) : nullptr;
 }
 
 ObjectRecord* ObjectTable::Add(uint32_t id, RemoteApp* app, bool isLocal, ScriptObject* object) {
-    if (!m_Free && !AddChunk()) return nullptr;
-    if (m_Count >= m_Size / 2) Grow();  // a chain that goes on is a cache miss more
-    ObjectRecord* record = m_Free;
-    m_Free = record->m_NextByID;
+    bool hasRoom = (m_Free || AddChunk()) && m_ByID.Reserve() && m_ByObject.Reserve();
+    if (!hasRoom) return nullptr;
+    uint32_t place = m_Free;
+    ObjectRecord* record = At(place);
+    m_Free = static_cast<uint32_t>(record->m_SeenAt);
+    record->m_SeenAt = 0;
     record->m_ID = id;
     record->m_Object = object;
     record->m_App = app;
     record->m_IsLocal = isLocal;
-    Link(record);
-    m_Count++;
+    m_ByID.Add(HashOf(id), place);
+    if (HasAddress(record)) m_ByObject.Add(HashOf(object), place);
     return record;
 }
 
+uint32_t ObjectTable::PlaceOf(const ObjectRecord* record) const {
+    return m_ByID.Find(HashOf(record->m_ID), [&](uint32_t at) { return At(at) == record; });
+}
+
 void ObjectTable::Remove(ObjectRecord* record) {
-    ObjectRecord** link = BucketOf(record->m_ID);
-    while (*link != record) link = &(*link)->m_NextByID;
-    *link = record->m_NextByID;
-    if (HasAddress(record)) {
-        link = BucketOf(record->m_Object);
-        while (*link != record) link = &(*link)->m_NextByObject;
-        *link = record->m_NextByObject;
+    uint32_t place = static_cast<uint32_t>(record->m_SeenAt);
+    if (!record->m_IsDetached) {
+        place = PlaceOf(record);
+        m_ByID.Remove(HashOf(record->m_ID), place);
+        if (HasAddress(record)) m_ByObject.Remove(HashOf(record->m_Object), place);
     }
     *record = {};
-    record->m_NextByID = std::exchange(m_Free, record);
-    m_Count--;
+    record->m_SeenAt = std::exchange(m_Free, place);
+}
+
+void ObjectTable::Detach(ObjectRecord* record) {
+    uint32_t place = PlaceOf(record);
+    m_ByID.Remove(HashOf(record->m_ID), place);
+    record->m_SeenAt = place;
+    record->m_IsDetached = true;
 }
 
 bool ObjectTable::AddChunk() {
-    auto* chunk = new RemoteObjectChunk{};
+    if (std::has_single_bit(m_NumParts) || !m_Parts) {
+        size_t room = m_Parts ? size_t{2} * m_NumParts : 1;
+        auto** parts = static_cast<ObjectRecord**>(g_ReusePoolMgr.Alloc(room * sizeof *m_Parts));
+        if (!parts) return false;
+        if (m_Parts) memcpy(parts, m_Parts, m_NumParts * sizeof *m_Parts);
+        g_ReusePoolMgr.Free(std::exchange(m_Parts, parts));
+    }
+    auto* chunk = new RemoteObjectChunk;
     if (!chunk) return false;
+    if (!m_Chunks) {
+        m_Factor = 0x9E3779B97F4A7C15u;
+        uint64_t factor;
+        ssize_t size = getrandom(&factor, sizeof factor, GRND_NONBLOCK);
+        if (size == sizeof factor) m_Factor = factor | 1;
+    }
     chunk->m_Next = std::exchange(m_Chunks, chunk);
-    for (int i = RemoteObjectChunk::kSize; i-- > 0;) {
-        chunk->m_Objects[i].m_NextByID = std::exchange(m_Free, &chunk->m_Objects[i]);
+    m_Parts[m_NumParts++] = chunk->begin();
+    uint32_t place = m_NumParts * RemoteObjectChunk::kSize;
+    for (ObjectRecord* record = chunk->end(); record-- != chunk->begin(); place--) {
+        *record = {};
+        record->m_SeenAt = std::exchange(m_Free, place);
     }
     return true;
 }
 
-// Doubles the index. Without memory its chains grow longer instead.
-void ObjectTable::Grow() {
-    uint32_t size = m_Size * 2;
-    size_t bytes = size_t{2} * size * sizeof(ObjectRecord*);
-    auto** buckets = size ? static_cast<ObjectRecord**>(g_ReusePoolMgr.Alloc(bytes)) : nullptr;
-    if (!buckets) return;
-    memset(buckets, 0, bytes);
-    uint64_t factor;
-    if (getrandom(&factor, sizeof factor, GRND_NONBLOCK) == sizeof factor) m_Factor = factor | 1;
-    ObjectRecord** old = std::exchange(m_Buckets, buckets);
-    ObjectRecord** oldEnd = old + m_Size;  // those by number
-    m_Size = size;
-    for (ObjectRecord** bucket = old; bucket != oldEnd; bucket++) {
-        for (ObjectRecord* record = *bucket; record;) {
-            Link(std::exchange(record, record->m_NextByID));
-        }
-    }
-    if (old != m_FirstBuckets) g_ReusePoolMgr.Free(old);
-}
-
 void ObjectTable::Clear() {
     while (m_Chunks) delete std::exchange(m_Chunks, m_Chunks->m_Next);
-    if (m_Buckets != m_FirstBuckets) g_ReusePoolMgr.Free(m_Buckets);
-    memset(m_FirstBuckets, 0, sizeof m_FirstBuckets);
-    m_Buckets = m_FirstBuckets;
-    m_Size = kFirstSize;
-    m_Count = 0;
-    m_Free = nullptr;
+    g_ReusePoolMgr.Free(std::exchange(m_Parts, nullptr));
+    m_NumParts = 0;
+    m_Free = 0;
+    m_ByID.Clear();
+    m_ByObject.Clear();
 }
 
 }  // namespace Korvel

@@ -3,12 +3,16 @@
 #include <algorithm>
 #include <cstdio>
 #include <iterator>
+#include <utility>
 
 #include "Platform/NoKillInternal.h"
+#include "core/ReusePoolInternal.h"
 #include "core/ScriptVal.h"
+#include "core/SpinLock.h"
 #include "diag/Env.h"
 #include "objects/ScriptSymbol.h"
 #include "remote/RemoteApp.h"
+#include "remote/TrafficInternal.h"
 
 namespace Korvel {
 namespace {
@@ -26,6 +30,72 @@ const char* TypeName(uint32_t type) {
     return type < std::size(s_PktType) ? s_PktType[type] : "PKT_?????";
 }
 
+// A large block comes fresh from the system each time, and the pages that it makes then cost more
+// than the bytes that are copied into them. So some of those that packets leave are kept for the
+// next ones.
+class SpareBlocks {
+public:
+    // Null when none fits.
+    void* Take(unsigned long size) {
+        if (size < kSmallest) return nullptr;
+        Hold hold(m_Lock);
+        void** best = nullptr;
+        for (void*& block : m_Blocks) {
+            if (!block || SizeOf(block) < size || SizeOf(block) / kMostWaste > size) continue;
+            if (!best || SizeOf(block) < SizeOf(*best)) best = &block;
+        }
+        if (!best) return nullptr;
+        m_Bytes -= SizeOf(*best);
+        return std::exchange(*best, nullptr);
+    }
+
+    // False when it is for the pools.
+    bool Keep(void* block) {
+        uint64_t size = SizeOf(block);
+        if (size < kSmallest || size > kMostBytes || GetNumConnections() == 0) return false;
+        Hold hold(m_Lock);
+        void** place = std::find(m_Blocks, std::end(m_Blocks), nullptr);
+        if (place == std::end(m_Blocks) || m_Bytes + size > kMostBytes) return false;
+        *place = block;
+        m_Bytes += size;
+        return true;
+    }
+
+    void Free() {
+        for (void*& place : m_Blocks) {
+            void* block;
+            {
+                Hold hold(m_Lock);
+                block = std::exchange(place, nullptr);
+                if (block) m_Bytes -= SizeOf(block);
+            }
+            g_ReusePoolMgr.Free(block);
+        }
+    }
+
+private:
+    static constexpr uint64_t kSmallest = 128 << 10;  // smaller ones the system hands out again
+    static constexpr uint64_t kMostBytes = 16 << 20;
+    static constexpr int kMostWaste = 4;  // times the size
+
+    static uint64_t SizeOf(void* block) {
+        return static_cast<PoolAccess::Block*>(block)[-1].m_Size;
+    }
+
+    // Inside of any other lock.
+    struct Hold {
+        explicit Hold(SpinLock& lock) : m_Lock(lock) {}
+        Platform::NoKill m_NoKill;
+        AutoSpinLock m_Lock;
+    };
+
+    SpinLock m_Lock;
+    void* m_Blocks[8] = {};
+    uint64_t m_Bytes = 0;
+};
+
+constinit SpareBlocks s_SpareBlocks;
+
 }  // namespace
 
 uint32_t GetMaxPacketSize() {
@@ -33,19 +103,24 @@ uint32_t GetMaxPacketSize() {
 }
 
 Packet* AllocPkt(unsigned long size) {
-    return static_cast<Packet*>(g_ReusePoolMgr.Alloc(size));
+    void* spare = s_SpareBlocks.Take(size);
+    return static_cast<Packet*>(spare ? spare : g_ReusePoolMgr.Alloc(size));
 }
 
 void FreePkt(Packet* packet) {
-    g_ReusePoolMgr.Free(packet);
+    if (packet && !s_SpareBlocks.Keep(packet)) g_ReusePoolMgr.Free(packet);
 }
 
-void DropValues(RemoteApp* app, Packet* packet) {
-    unsigned char* cursor = packet->Payload();
-    for (int i = 0; i < 2; i++) {
-        ScriptVal value;
-        if (!value.FromPkt(app, cursor, packet->End())) return;
+void FreeSparePackets() {
+    s_SpareBlocks.Free();
+}
+
+bool DropValues(RemoteApp* app, Packet* packet) {
+    bool isValid = ScriptVal::FromPacket(app, packet, nullptr, nullptr);
+    if (packet->m_Type == PKT_Reply && packet->m_Target && app) {
+        if (RemoteObject* proxy = app->IncRemoteRef(packet->m_Target)) proxy->DecRef();
     }
+    return isValid;
 }
 
 void DropPkt(RemoteApp* app, Packet* packet) {
@@ -53,7 +128,10 @@ void DropPkt(RemoteApp* app, Packet* packet) {
     FreePkt(packet);
 }
 
-Packet* CreatePkt(uint32_t type, RemoteApp* app, const ScriptVal* first, const ScriptVal* second) {
+namespace {
+
+Packet* Create(uint32_t type, RemoteApp* app, uint16_t run, const ScriptVal* first,
+               const ScriptVal* second) {
     if (!first) first = &ScriptVal::nil;
     if (!second) second = &ScriptVal::nil;
     uint32_t firstSize = first->CalcPktSize();
@@ -65,11 +143,18 @@ Packet* CreatePkt(uint32_t type, RemoteApp* app, const ScriptVal* first, const S
     *packet = {};
     packet->m_Size = static_cast<uint32_t>(size);
     packet->m_Type = type;
-    if (app) packet->m_Flags = app->GetFlags() & PKF_Trace;
-    unsigned char* cursor = packet->Payload();
-    first->ToPkt(app, cursor);
-    second->ToPkt(app, cursor);
+    if (app) {
+        packet->m_Flags = app->GetFlags() & PKF_Trace;
+        packet->m_Reserved = run ? run : app->GetRun();
+    }
+    WriteValues(packet, app, *first, *second);
     return packet;
+}
+
+}  // namespace
+
+Packet* CreatePkt(uint32_t type, RemoteApp* app, const ScriptVal* first, const ScriptVal* second) {
+    return Create(type, app, 0, first, second);
 }
 
 Packet* CreateReply(uint32_t context, RemoteApp* app, const ScriptVal* first,
@@ -84,6 +169,18 @@ Packet* CreateReply(Packet* request, RemoteApp* app, const ScriptVal* first,
     return CreateReply(request->m_Context, app, first, second);
 }
 
+Packet* CreateReplyOrError(uint32_t context, RemoteApp* app, uint16_t run, const ScriptVal* first,
+                           const ScriptVal* second) {
+    Packet* reply = Create(PKT_Reply, app, run, first, second);
+    if (!reply) {
+        ScriptVal error(SV_Table, nullptr);
+        error.SetError(SCERR_Unknown, kTooLarge);
+        reply = Create(PKT_Reply, app, run, nullptr, &error);
+    }
+    if (reply) reply->m_Context = context;
+    return reply;
+}
+
 void DumpPacket(const Packet* packet, const RemoteApp* app, const char* direction) {
     Platform::NoKill noKill;
     uint32_t opcode = packet->m_Symbol - SST_FirstOpcode;
@@ -91,6 +188,12 @@ void DumpPacket(const Packet* packet, const RemoteApp* app, const char* directio
     printf("App %p: %s ctx=%u tgt=%u %s %s%s\n", static_cast<const void*>(app), direction,
            packet->m_Context, packet->m_Target, TypeName(packet->m_Type),
            hasOpcode ? SSTName[opcode] : "", hasOpcode ? " " : "");
+}
+
+void TraceValues(const char* arrow, uint32_t context, const ScriptVal& values) {
+    Platform::NoKill noKill;
+    printf("   %s [%u] ", arrow, context);
+    values.Dump();
 }
 
 }  // namespace Korvel

@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <memory>
 
 #include "Platform/Lock.h"
 #include "core/OxString.h"
@@ -10,15 +11,14 @@
 #include "remote/RemoteObject.h"
 
 namespace Korvel::Platform {
-struct _Event;
 struct _Socket;
 struct _SocketSet;
-struct _Thread;
 }  // namespace Korvel::Platform
 
 namespace Korvel {
 
 class Packet;
+class ScriptInfo;
 struct ObjectRecord;
 struct Request;
 
@@ -37,12 +37,18 @@ inline Platform::_Socket* const kInProcess = reinterpret_cast<Platform::_Socket*
 // Ending:   Disconnect closes when nothing is under way any more, _Disconnect at once. A connection
 //           through which neither side holds anything of the other closes by itself. Whoever waits
 //           for a reply then gets null.
-// Threads:  any, for the public operations, where nothing else is said. Code on the connection's
-// own
-//           thread cannot wait for a reply on it: such calls fail at once, with a line in the log.
+// Threads:  any, for the public operations, where nothing else is said. Who cannot get a reply does
+//           not wait for it, but fails at once, with a line in the log: code on the connection's
+//           own thread, and the UI thread while a member that the peer has called waits for it.
+// Limits:   the connection ends, with a line in the log, when the peer has shown no sign of life
+//           for KORVEL_PeerTimeoutSeconds (90; up to 130 where it had stopped reading), when
+//           the queue of packets to it exceeds KORVEL_MaxQueueSize (1024, in MiB), and when more
+//           than KORVEL_StalledQueueSize of it (64, in MiB) does not move for KORVEL_StallSeconds
+//           (60).
 // Locks:    docs/threads.md has the order. No code of others runs under any of them.
 class KORVEL_EXPORT RemoteApp : public ObjectReferences {
 public:
+    // With a socket it connects and tells the host.
     RemoteApp(const char* name, unsigned int ip, Platform::_Socket* socket);
     RemoteApp(const RemoteApp&) = delete;
     RemoteApp& operator=(const RemoteApp&) = delete;
@@ -54,7 +60,10 @@ public:
     // Takes over a connected socket and starts the thread; ends what was connected before. False,
     // with the socket closed, when there is no thread or no memory.
     virtual bool Connect(Platform::_Socket* socket);
-    // TODO(remote): connects by address and port, and shakes hands. False so far.
+    // Connects by address (in network order) and port, within the process where that is its own,
+    // and shakes hands; ends what was connected before. False, and not connected, when nobody is
+    // there or answers in time, when the peer refuses, and when its UUID is not the one that this
+    // connection has. Without one it takes the peer's. ScriptApp.h tells of `reply`.
     virtual bool Connect(unsigned int ip, unsigned int port, ScriptVal& reply);
 
     // Ends the connection and waits for its thread, in milliseconds; 0xFFFFFFFF has no limit. False
@@ -79,7 +88,8 @@ public:
     // A proxy by its number, nil when there is none; it holds a count.
     virtual ScriptVal FindRemoteObject(unsigned long long id);
     // An exported object by its number, with one IncRef on it for the caller; null when this
-    // connection does not export it, or it has died.
+    // connection does not export it, or it has died. The record may become another object's when
+    // the peer lets go at the same time: HoldLocalObject gives the object itself.
     virtual RemoteObject* FindLocalObject(unsigned long long id);
     // One more, one less reference of this process to an object of the peer. The first makes the
     // proxy if need be; null for 0. The last DecRemoteRef tells the peer.
@@ -87,6 +97,9 @@ public:
     virtual void DecRemoteRef(unsigned long long id);
 
     virtual void Disconnect();
+
+    // Packets. An object of this process in a reply is sure to be found there by callbacks, and by
+    // Exchange: the peer may have let go of it when another thread opens the packet later.
 
     // Puts a packet on the queue, which takes it over. Returns the request's number; 0, with the
     // packet freed, when not connected. A reply keeps its number.
@@ -106,17 +119,16 @@ public:
     virtual void DoWrite();
     virtual void DispatchPacket(Packet* packet);
 
-    // TODO(remote): connect by name. False so far.
     virtual bool Connect(ScriptVal& reply);
     virtual bool Connect();
     virtual bool AsyncConnect();
 
     virtual bool Connected() const;
-    virtual unsigned int GetIPAddress() const;  // in network order
-    virtual OxStringT<char> GetName() const;    // as the peer claims
-    virtual OxStringT<char> GetHostName() const;
-    virtual ScriptVal GetUUID() const;  // of the peer, as it claims
-    virtual bool ClearUUID();           // false while connected
+    virtual unsigned int GetIPAddress() const;    // in network order
+    virtual OxStringT<char> GetName() const;      // as the peer claims
+    virtual OxStringT<char> GetHostName() const;  // its address, as a text
+    virtual ScriptVal GetUUID() const;            // of the peer, as it claims
+    virtual bool ClearUUID();                     // false while connected
     virtual bool IsUUID(const ScriptVal& uuid) const;
     virtual Platform::_Socket* GetSocket() const;
 
@@ -136,8 +148,12 @@ public:
     // Joins two connections within the process. False when one of them is connected.
     static bool Join(RemoteApp* a, RemoteApp* b);
 
-    // DoPkt for a packet that it takes over in any case.
+    // DoPkt for a packet that it takes over in any case; the second form also opens the reply, and
+    // gives its second value. False when there was none.
     Packet* ExchangePkt(Packet* packet);
+    bool Exchange(Packet* packet, ScriptVal& result);
+    // Whether this thread may wait for a reply; else it tells the log why not.
+    bool MayWait() const;
 
     // The same as WaitPkt with a time-out of its own: 0 is for ever, below 0 only looks.
     Packet* WaitPkt(uint32_t context, double timeOut);
@@ -154,81 +170,165 @@ public:
 
     // The error of the last reply that had one; it stays until it is taken.
     void SetLastError(uint32_t number, const char* text);
+    void KeepError(const ScriptVal& results);  // of a call, where they have one
     uint32_t TakeLastError(OxStringT<char>& text);
 
     // The object of this process that has a number; no count. Null when there is none.
     static ScriptObject* GetObjectPtr(unsigned long long id);
 
-    // The peer's name and UUID, from keys 1 and 2. What it claims, cut to what there is room for.
-    void SetConnectionInfo(ScriptVal& args);
+    // The number of a proxy on the wire, UINT32_MAX for one of a run that has ended.
+    uint32_t NumberOf(const RemoteObject& proxy) const;
+    // What packets count, in the run that they belong to; 0 is any. The number of an object, as
+    // _IncLocalRef counts it, 0 for none; and a proxy as IncRemoteRef gives it.
+    uint32_t Export(ScriptObject* object, uint16_t run);
+    RemoteObject* Import(uint32_t id, uint16_t run);
 
-protected:
-    // Whether calls would wait for the thread that makes them.
-    bool IsConnectionThread() const;
+    // Each connecting is a new run, with a number of its own. IsRun asks whether it still goes on.
+    uint16_t GetRun() const;
+    bool IsRun(uint16_t run) const;
+    // Lets all go that the peer of a run held. Nothing once another one has begun.
+    void Cleanup(uint16_t run);
 
-    // What the engine asks of the tables, without holding a lock.
-
-    // Makes the entries of number 1, for a new object; nothing may be exported.
-    void InitReferences();
-    // At the start of a run, once Connected(): asks for the application's object again, and counts
-    // it for the peer.
-    void HoldRoot();
-    // After a run, or when connecting has failed: all that the peer held goes. Nothing when
-    // connected.
-    void CleanUpReferences();
-    void FreeReferences();  // for the destructor
+    // The calling thread begins or ends a wait for the UI thread.
+    static void SetWaitingForUI(bool isWaiting);
 
     // The object with a number as FindLocalObject finds it, with one IncRef for the caller. Unlike
     // the fields of a record it stays what it is. Null also when number 1 has no object.
     ScriptObject* HoldLocalObject(unsigned long long id);
+
+    // Nothing more is done for the peer of a run, which ends when its last reply has been sent.
+    // Nothing at all once another run has begun.
+    void Refuse(uint16_t run);
+
+    // The peer's name and UUID, from keys 1 and 2. What it claims, cut to what there is room for.
+    void SetConnectionInfo(ScriptVal& args);
+
+    // Whether an address is this machine's: 127.0.0.1, or one that leads to this machine's name. It
+    // may wait for name servers.
+    static bool IsLocalIP(unsigned int ip);
+    static bool IsLocalIP(const char* address);
+    // The address that four numbers with dots between them are, or that a machine of this name has;
+    // 0 for none. For a name it may wait for name servers.
+    static unsigned int IPFromStr(const char* text);
+    // Writes an address as four numbers, cut to `length` - 1 bytes. Returns the bytes written.
+    static int StrFromIP(unsigned int ip, char* text, int length);
+
+protected:
+    // A proxy of the peer's application object, connected or not. Nil without memory.
+    ScriptVal GetRoot();
+    // What is known of the peer. Texts are cut to what there is room for.
+    void SetPeer(const char* name, const char* hostName, unsigned int ip, const ScriptVal& uuid);
+
+    // Tells the host that the connection is made, and from then on of its end, too.
+    void ReportConnect();
+
+    // What the engine asks of the tables, without holding a lock.
+
+    // Before a run: makes the entries of number 1 and asks for the application's object; nothing
+    // may be exported.
+    void InitReferences();
+    void HoldRoot();        // at its start: counts that object for the peer
+    void FreeReferences();  // for the destructor
+
     // All references of the peer to the object with a number, in one step. False when it is not
     // exported or dead.
     bool DropLocalRefs(unsigned long long id);
-    // One more reference to the object at an address that the peer has named. Null when there is no
+    // One more reference to the object at an address that the peer has named. 0 when there is no
     // object there that scripts have ever seen.
-    RemoteObject* ExportAddress(unsigned long long address);
+    uint32_t ExportAddress(unsigned long long address);
 
 private:
     friend class RemoteObject;
+    friend ScriptVal ScriptApp(unsigned int ip, unsigned int port, ScriptVal& reply,
+                               double timeOut);
+    friend ScriptVal ScriptApp(RemoteApp* app, Platform::_Socket* socket, const char* name,
+                               ScriptVal uuid);
+    friend void ForEachApp(void (*visit)(void* data, RemoteApp& app), void* data);
+
+    // Connecting
+    bool ConnectThere(unsigned int ip, unsigned int port);
+    bool ConnectHere();
+    bool ShakeHands(ScriptVal& root, ScriptVal& reply);
+    static OxStringT<char> CutName(const char* name);
+
+    // On g_AppList
+    void Enlist();
+    void Delist();
+    bool UseIfHeld() const;
+
+    // A run
+    bool BeginRun();
+    bool StartThread(Platform::_Socket* socket, RemoteApp* peer);
+    bool PrepareLocked(Platform::_Socket* socket);
+    void FreeSetLocked();
+    bool IsConnectionThread() const;
+    bool AwaitEnd(int64_t deadlineNs);
+    void EndThread();
+    void ReleaseUI();
+    void LeavePeer();
+    void CloseDown();
+    void GiveUpRun();
+    bool IsPeer(const RemoteApp* app) const;
+    // With a text that stays; nothing in another run than the one with this number, if there is
+    // one.
+    void Close(const char* why, uint32_t run = 0);
+
+    // Telling the host
+    using UIStep = unsigned long long (*)(void* app, void* run);
+    bool RunOnUI(UIStep step);
+    void ReportEnd();
+    bool SetReported(bool isReported);
+    static unsigned long long TellConnect(void* app, void* run);
+    static unsigned long long TellEnd(void* app, void* run);
 
     // Any thread
     uint32_t Submit(Packet* packet, Request* request);
+    bool AddLocked(Request* request, uint32_t context);
+    RemoteApp* HoldReaderLocked();
     uint32_t SendReplyPkt(Packet* packet);
-    bool PostLocked(Packet* packet);
+    bool PostLocked(Packet* packet, uint64_t maxQueueSize);
     void Wake();
-    bool CanWait() const;
-    Packet* WaitFor(Request* request, double timeOut);
-    bool LookForReply(const Request& request);
-    void Close(const char* why);
+    const char* WhyNotWait(bool isFromUI) const;
+    std::unique_ptr<Request> Ask(Packet* packet, bool wantsValues);
+    std::unique_ptr<Request> WaitFor(Request* request, double timeOut);
 
     // The connection's thread
-    bool StartThread();
     void Sleep();
     unsigned int GetSleepMs();
     bool Serve();
+    bool WriteSome();
     bool ReadSocket();
     bool TakeInput();
     bool FinishReading();
-    void ReadPeer();
-    Packet* TakeOutgoing();
-    bool IsIdle();
-    void EndOverdue();
+    void SetThreshold();
+    bool ReadPeer();
+    Packet* GetNextSendPacket();
+    Packet* TakeFor(const RemoteApp* peer, bool mayWait);
+    bool BeginLarge(uint32_t size, const unsigned char* bytes, uint32_t length);
+    bool IsIdle() const;
+    void EndOverdue(int64_t now);
+    void CheckPeer(int64_t now);
     void DropRequests(Request* requests);
-    void CloseDown();
 
     // What has arrived; requests also on the UI thread
     void HandleReply(Packet* reply);
+    bool OpenReply(Packet* reply);
     void HandleRequest(Packet* packet);
     void HandleScriptPacket(Packet* packet);
+    void Reply(Packet* request, const ScriptVal* second = nullptr, uint32_t target = 0);
+    void ReplyError(Packet* request, ScriptError code, const char* text = nullptr);
     void CallMember(Packet* packet);
+    void CallMember(Packet* packet, ScriptObject* object, ScriptInfo* info);
     void CountReference(Packet* packet);
     void GetInfo(Packet* packet);
     void TakeStateData(Packet* packet);
+    void Drop(Packet* packet);
     bool PassToUI(Packet* packet);
     static unsigned long long DoPacket(void* app, void* packet);
 
     // Objects
-    ObjectRecord* CountExport(ScriptObject* object, ScriptObject** held);
+    RemoteObject* IncLocal(ScriptObject* object, uint16_t run);
+    ObjectRecord* CountExport(ScriptObject* object, uint16_t run, ScriptObject** held);
     ObjectRecord* AddExportLocked(ScriptObject* object, uint32_t id);
     ObjectRecord* FindExportLocked(const ScriptObject* object) const;
     ScriptObject* RemoveExportLocked(ObjectRecord* record);
@@ -237,9 +337,21 @@ private:
     void Finish(const Released& released);
     ScriptObject* HoldObject(unsigned long long id, RemoteObject*& found);
     void Unpin(ObjectRecord* record);
-    uint32_t ReleaseExports();
-    RemoteObject* CountProxy(unsigned long long id, bool canAdd);
+    uint32_t ReleaseExports(uint16_t run);
+    bool HasEndedLocked(uint16_t run) const;
+    void CountProxyLocked(ObjectRecord* record);
+    struct DroppedProxy;
+    DroppedProxy DropProxyLocked(ObjectRecord* record);
+    void Finish(const DroppedProxy& dropped);
+    void DetachProxies();
+    void IncProxy(RemoteObject* proxy);
+    void DecProxy(RemoteObject* proxy);
+    RemoteObject* CountProxy(unsigned long long id, uint16_t run, bool canAdd);
     void EndIfUnused();
+
+    // Guarded by g_AppLock
+    RemoteApp* m_Next = nullptr;
+    RemoteApp** m_Link = nullptr;  // that points here; null when not on the list
 
     mutable std::atomic<uint32_t> m_UseCount{1};
     const uint64_t m_AppID;

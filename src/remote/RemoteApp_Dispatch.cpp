@@ -1,9 +1,7 @@
 // What a connection does with the packets that arrive.
-#include <memory>
+#include <cstring>
 #include <utility>
 
-#include "Platform/NoKillInternal.h"
-#include "core/ScriptHooksInternal.h"
 #include "core/ScriptValInternal.h"
 #include "objects/ScriptConfig.h"
 #include "objects/ScriptObject.h"
@@ -13,28 +11,6 @@
 
 namespace Korvel {
 namespace {
-
-constexpr uint32_t kMostForUI = 65536;
-constexpr uint64_t kMostBytesForUI = uint64_t{64} << 20;
-
-void Reply(RemoteApp* app, Packet* request, const ScriptVal* second = nullptr,
-           uint32_t target = 0) {
-    Packet* reply = CreateReply(request, app, nullptr, second);
-    if (!reply) {
-        ScriptVal error(SV_Table, nullptr);
-        error.SetError(SCERR_Unknown, "Packet too large.");
-        reply = CreateReply(request, app, nullptr, &error);
-    }
-    if (!reply) return;
-    reply->m_Target = target;
-    app->SendPkt(reply);
-}
-
-void ReplyError(RemoteApp* app, Packet* request, ScriptError code, const char* text = nullptr) {
-    ScriptVal error(SV_Table, nullptr);
-    error.SetError(code, text);
-    Reply(app, request, &error);
-}
 
 // Takes out what members alone set.
 void UnlinkReserved(ScriptArgs& args) {
@@ -51,52 +27,84 @@ void UnlinkReserved(ScriptArgs& args) {
     ReleaseChain(taken);
 }
 
-constexpr char kNoValues[] = "the peer sent a packet with no valid values";
+// Whether there may be an object of ours in a packet: false is sure.
+bool MayNameOurs(const Packet& packet) {
+    return memchr(packet.Payload(), SV_RemoteObject, packet.m_Size - sizeof(Packet));
+}
 
 }  // namespace
+
+void RemoteApp::Reply(Packet* request, const ScriptVal* second, uint32_t target) {
+    auto run = static_cast<uint16_t>(request->m_Reserved);
+    Packet* reply = CreateReplyOrError(request->m_Context, this, run, nullptr, second);
+    if (!reply) return Close(kNoMemoryForReply, request->m_Reserved);
+    reply->m_Target = target;
+    SendPkt(reply);
+}
+
+void RemoteApp::ReplyError(Packet* request, ScriptError code, const char* text) {
+    ScriptVal error(SV_Table, nullptr);
+    error.SetError(code, text);
+    Reply(request, &error);
+}
 
 // Runs what a PKT_Script asks for.
 void RemoteApp::CallMember(Packet* packet) {
     if (!packet->m_Target || !packet->m_Symbol) {
-        ReplyError(this, packet, SCERR_Unknown, "No object/symbol id specified.");
-        return DropValues(this, packet);
+        ReplyError(packet, SCERR_Unknown, "No object/symbol id specified.");
+        return Drop(packet);
     }
-    ScriptArgs args;
-    args.m_Value.m_Args.m_Context = packet->m_Context;
-    if (!ScriptVal::FromPacket(this, packet, nullptr, &args)) return Close(kNoValues);
-    if (!args.IsArgs()) return ReplyError(this, packet, SCERR_InvalidArgs);
-    UnlinkReserved(args);
-    args.SetApp(this);
     ScriptObject* object = HoldLocalObject(packet->m_Target);
     ScriptInfo* info = object ? object->GetScriptInfo() : nullptr;
-    ScriptSymbol* symbol = info ? info->FindSymbol(nullptr, packet->m_Symbol) : nullptr;
-    if (!info) {
-        ReplyError(this, packet, SCERR_InvalidRemoteObject);
-    } else if (!symbol) {
-        ReplyError(this, packet, SCERR_UnknownSymbol);
+    if (info) {
+        CallMember(packet, object, info);
     } else {
-        symbol->Call(object, args, false);
-        if (!(args.m_Flags & SVF_ReplyDeferred) && !args.SendReply()) {
-            ReplyError(this, packet, SCERR_Unknown, "Packet too large.");
-        }
+        ReplyError(packet, SCERR_InvalidRemoteObject);
+        Drop(packet);
     }
     if (object) object->DecRef();
 }
 
+void RemoteApp::CallMember(Packet* packet, ScriptObject* object, ScriptInfo* info) {
+    uint16_t run = static_cast<uint16_t>(packet->m_Reserved);
+    ScriptArgs args;
+    if (!ScriptVal::FromPacket(this, packet, nullptr, &args)) return Close(kNoValues, run);
+    if (!args.IsArgs()) return ReplyError(packet, SCERR_InvalidArgs);
+    UnlinkReserved(args);
+    args.SetApp(this);
+    args.m_Value.m_Args.m_Context = packet->m_Context;
+    args.m_Value.m_Args.m_Run = run;
+    if ((m_Flags | packet->m_Flags) & PKF_Trace) TraceValues("->", packet->m_Context, args);
+    bool isKind = packet->m_Symbol < SST_EndOpcode;
+    ScriptSymbol* symbol = isKind ? info->FindSymbol(nullptr, packet->m_Symbol) : nullptr;
+    if (!symbol) return ReplyError(packet, SCERR_UnknownSymbol);
+    symbol->Call(object, args, false);
+    bool isDeferred = args.m_Flags & SVF_ReplyDeferred;
+    if (!isDeferred && !args.SendReply()) Close(kNoMemoryForReply, run);
+}
+
+// Lets the values of a packet go that nobody opens.
+void RemoteApp::Drop(Packet* packet) {
+    if (!DropValues(this, packet)) Close(kNoValues, packet->m_Reserved);
+}
+
 void RemoteApp::HandleScriptPacket(Packet* packet) {
-    if (!g_ScriptConfig.load(std::memory_order_acquire)) {
-        ReplyError(this, packet, SCERR_NotInitialized);
-        DropValues(this, packet);
+    if (!g_ScriptConfig.load(std::memory_order_acquire) || m_Traffic->m_IsRefused) {
+        ReplyError(packet, SCERR_NotInitialized);
     } else if (packet->m_Type == PKT_Script) {
-        CallMember(packet);
+        return CallMember(packet);
+    } else if (packet->m_Type == PKT_DecRef) {
+        CountReference(packet);
     } else if (DropLocalRefs(packet->m_Target)) {
-        Reply(this, packet);
+        Reply(packet);
     } else {
-        ReplyError(this, packet, SCERR_InvalidObject, "Cannot find object for PKT_NoMoreRefs.");
+        ReplyError(packet, SCERR_InvalidObject, "Cannot find object for PKT_NoMoreRefs.");
     }
+    Drop(packet);
 }
 
 void RemoteApp::DispatchPacket(Packet* packet) {
+    packet->m_Reserved = m_Traffic->m_Run;  // which does not change while its thread runs
     if ((m_Flags | packet->m_Flags) & PKF_Trace) DumpPacket(packet, this, "Recv");
     if (packet->m_Type == PKT_Reply) {
         HandleReply(packet);
@@ -105,70 +113,102 @@ void RemoteApp::DispatchPacket(Packet* packet) {
     }
 }
 
-void RemoteApp::HandleReply(Packet* reply) {
-    Request* async = nullptr;
+// The peer may let go of an object of ours right behind the reply that names it. So the values are
+// read before the next packet is served, and not when the waiter comes to it.
+bool RemoteApp::OpenReply(Packet* reply) {
     {
-        Platform::NoKill noKill;
-        KorvelScript::AutoLock guard(m_Lock);
+        AutoAppLock guard(m_Lock);
         Request* request = m_Traffic->m_Requests.Find(reply->m_Context);
+        if (!request || !request->m_WantsValues) return false;
+    }
+    if (!MayNameOurs(*reply)) return false;
+    ScriptVal values;
+    if (!ScriptVal::FromPacket(this, reply, nullptr, &values)) Close(kNoValues);
+    Request* request;
+    bool isAsleep = false;
+    {
+        AutoAppLock guard(m_Lock);
+        request = m_Traffic->m_WhyClosed ? nullptr : m_Traffic->m_Requests.Find(reply->m_Context);
+        if (request && !request->m_Waiter.IsOver()) {
+            request->m_Values = std::move(values);
+            request->m_HasValues = true;
+            isAsleep = request->m_Waiter.EndQuietly();
+        }
+    }
+    if (isAsleep) Waiter::WakeUp(&request->m_Waiter);
+    return true;
+}
+
+void RemoteApp::HandleReply(Packet* reply) {
+    if (OpenReply(reply)) return FreePkt(reply);
+    Request* request;
+    bool isAsleep = false;
+    {
+        AutoAppLock guard(m_Lock);
+        Traffic& traffic = *m_Traffic;
+        request = traffic.m_Requests.Find(reply->m_Context);
+        if (!request && traffic.m_NumSilent) traffic.m_NumSilent--;
         if (request && request->m_IsAsync) {
-            m_Traffic->m_Requests.Remove(request);
-            async = request;
-        } else if (request && !request->m_IsOver) {
+            traffic.m_Requests.Remove(request);
+        } else if (request && !request->m_Waiter.IsOver()) {
             request->m_Reply = std::exchange(reply, nullptr);
-            request->m_IsOver = true;
-            // Its waiter may end it as soon as the lock is free.
-            if (request->m_HasWaiter) request->m_Event.Signal();
+            isAsleep = request->m_Waiter.EndQuietly();
         }
     }
-    if (async) {
-        bool isTaken =
-            async->m_Callback && async->m_Callback(async->m_Data, this, reply, async->m_Context);
-        if (isTaken) reply = nullptr;
-        if (!async->m_Callback || isTaken) {
-            delete async;
-        } else {  // it stays until somebody asks for it
-            KorvelScript::AutoLock guard(m_Lock);
-            async->m_IsAsync = false;
-            async->m_IsOver = true;
-            async->m_Reply = std::exchange(reply, nullptr);
-            m_Traffic->m_Requests.Add(async);
-        }
+    if (isAsleep) Waiter::WakeUp(&request->m_Waiter);
+    if (!reply) return;
+    if (!request || !request->m_IsAsync) {
+        Drop(reply);
+        return FreePkt(reply);
     }
-    if (reply) DropPkt(this, reply);
+    if (request->m_Callback(request->m_Data, this, reply, request->m_Context)) {
+        delete request;
+        return;
+    }
+    // It stays until somebody asks for it.
+    request->m_IsAsync = false;
+    request->m_Callback = nullptr;
+    request->m_DeadlineNs = 0;
+    request->m_Reply = reply;
+    request->m_Waiter.End();
+    AutoAppLock guard(m_Lock);
+    m_Traffic->m_Requests.Add(request);
 }
 
 void RemoteApp::HandleRequest(Packet* packet) {
+    if (m_Traffic->m_IsRefused) {
+        Drop(packet);
+        return FreePkt(packet);
+    }
     {
-        KorvelScript::AutoLock guard(m_Lock);
+        AutoAppLock guard(m_Lock);
         m_Traffic->m_NumUnanswered++;
     }
     switch (packet->m_Type) {
         case PKT_Script:
+        case PKT_NoMoreRefs:
+        case PKT_DecRef:
             if (PassToUI(packet)) return;
             HandleScriptPacket(packet);
             break;
-        case PKT_NoMoreRefs:
-            HandleScriptPacket(packet);
-            break;
         case PKT_IncRef:
-        case PKT_DecRef:
             CountReference(packet);
+            Drop(packet);
             break;
         case PKT_GetObjectInfo:
             GetInfo(packet);
             break;
-        case PKT_LocalToRemote: {
-            RemoteObject* record =
-                ExportAddress(packet->m_Symbol | static_cast<uint64_t>(packet->m_Target) << 32);
-            Reply(this, packet, nullptr, record ? record->m_ID : 0);
+        case PKT_LocalToRemote:
+            Reply(packet, nullptr,
+                  ExportAddress(packet->m_Symbol | static_cast<uint64_t>(packet->m_Target) << 32));
+            Drop(packet);
             break;
-        }
         case PKT_SetStateData:
             TakeStateData(packet);
             break;
         default:
-            ReplyError(this, packet, SCERR_UnknownPacket);
+            ReplyError(packet, SCERR_UnknownPacket);
+            DropValues(this, packet);  // whether or not they are valid
             break;
     }
     FreePkt(packet);
@@ -183,49 +223,50 @@ void RemoteApp::CountReference(Packet* packet) {
         }
         object->DecRef();
     }
-    Reply(this, packet);
+    Reply(packet);
 }
 
 void RemoteApp::GetInfo(Packet* packet) {
     ScriptVal query;
     if (!ScriptVal::FromPacket(this, packet, nullptr, &query)) return Close(kNoValues);
     ScriptObject* object = HoldLocalObject(packet->m_Target);
-    if (!object) return Reply(this, packet);
+    if (!object) return Reply(packet);
     ScriptVal result(SV_Table, nullptr);
     object->GetObjectInfo(query, result);
     object->DecRef();
-    Reply(this, packet, &result);
+    Reply(packet, &result);
 }
 
 void RemoteApp::TakeStateData(Packet* packet) {
     ScriptVal data;
     if (!ScriptVal::FromPacket(this, packet, nullptr, &data)) return Close(kNoValues);
     {
-        KorvelScript::AutoLock guard(m_Lock);
+        AutoAppLock guard(m_Lock);
         std::swap(m_StateData, data);
     }
-    Reply(this, packet);
+    Reply(packet);
 }
 
 // Leaves a call to the UI thread, where the host has one, but for the two that find out by
-// themselves whether they have to go there. True when the packet has been taken over.
+// themselves whether they have to go there; and a release, which must not overtake a call. True
+// when the packet has been taken over.
 bool RemoteApp::PassToUI(Packet* packet) {
     ScriptConfig* config = g_ScriptConfig.load(std::memory_order_acquire);
-    bool isForUI = config && config->m_Active && config->UIExecute &&
-                   packet->m_Symbol != SST_GetTable && packet->m_Symbol != SST_CallFunction;
-    if (!isForUI) return false;
+    if (!config || !config->m_Active || !config->UIExecute) return false;
+    bool isCall = packet->m_Type == PKT_Script;
+    if (isCall && (packet->m_Symbol == SST_GetTable || packet->m_Symbol == SST_CallFunction)) {
+        return false;
+    }
     Traffic& traffic = *m_Traffic;
-    uint32_t count = ++traffic.m_NumForUI;
-    uint64_t bytes = traffic.m_BytesForUI += packet->m_Size;
-    if (count <= kMostForUI && bytes <= kMostBytesForUI) {
-        Use();
-        config->UIExecute(DoPacket, this, packet, false);
+    if (!(isCall ? traffic.m_CallsForUI : traffic.m_ReleasesForUI).Add(packet->m_Size)) {
+        if (!isCall) return false;  // a release is served in any case
+        ReplyError(packet, SCERR_Unknown, "Too many unanswered requests.");
+        Drop(packet);
+        FreePkt(packet);
         return true;
     }
-    traffic.m_NumForUI--;
-    traffic.m_BytesForUI -= packet->m_Size;
-    ReplyError(this, packet, SCERR_Unknown, "Too many unanswered requests.");
-    DropPkt(this, packet);
+    Use();
+    config->UIExecute(DoPacket, this, packet, false);
     return true;
 }
 
@@ -233,9 +274,11 @@ bool RemoteApp::PassToUI(Packet* packet) {
 unsigned long long RemoteApp::DoPacket(void* appPointer, void* packetPointer) {
     auto* app = static_cast<RemoteApp*>(appPointer);
     auto* packet = static_cast<Packet*>(packetPointer);
-    app->m_Traffic->m_NumForUI--;
-    app->m_Traffic->m_BytesForUI -= packet->m_Size;
-    app->HandleScriptPacket(packet);
+    Traffic& traffic = *app->m_Traffic;
+    bool isCall = packet->m_Type == PKT_Script;
+    (isCall ? traffic.m_CallsForUI : traffic.m_ReleasesForUI).Remove(packet->m_Size);
+    // What the packet names has gone with its run.
+    if (app->GetRun() == packet->m_Reserved) app->HandleScriptPacket(packet);
     FreePkt(packet);
     app->Recycle();
     return 0;

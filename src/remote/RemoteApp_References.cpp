@@ -8,25 +8,23 @@
 //
 // Objects are foreign code. They are counted with no lock held: before their record is made, after
 // it has been removed, and while a pin keeps it.
-#include <cassert>
 #include <cstdio>
 #include <typeinfo>
 #include <utility>
 
 #include "Platform/NoKillInternal.h"
 #include "core/ScriptHooksInternal.h"
-#include "core/SpinLock.h"
+#include "core/SpinLockInternal.h"
 #include "objects/ScriptConfig.h"
 #include "objects/ScriptObject.h"
 #include "remote/ObjectTableInternal.h"
 #include "remote/Packets.h"
 #include "remote/RemoteApp.h"
+#include "remote/TrafficInternal.h"
 
 namespace Korvel {
 namespace {
 
-constexpr uint32_t kRootID = 1;
-constexpr uint32_t kNoID = UINT32_MAX;        // on the wire: an object that cannot be named
 constexpr uint32_t kStuckCount = UINT32_MAX;  // a count that came this far is not counted any more
 constexpr uint32_t kAllCounts = UINT32_MAX;
 
@@ -37,38 +35,11 @@ constinit SpinLock s_LocalLock;
 constinit ObjectTable s_LocalObjectList;
 constinit uint32_t s_NextLocalID = kRootID + 1;
 constinit uint64_t s_NextSerial = 1;
+constinit uint64_t s_NumDeaths = 0;  // of exported objects
 
-constinit thread_local bool t_HasLocalLock = false;
-
-// Holds s_LocalLock. It is the last in the order: with it, no other lock is taken.
-class AutoLocalLock {
-public:
-    AutoLocalLock() {
-        assert(!t_HasLocalLock && "s_LocalLock is not recursive");
-        s_LocalLock.Obtain();
-        t_HasLocalLock = true;
-    }
-    AutoLocalLock(const AutoLocalLock&) = delete;
-    AutoLocalLock& operator=(const AutoLocalLock&) = delete;
-    ~AutoLocalLock() {
-        t_HasLocalLock = false;
-        s_LocalLock.Release();
-    }
-
-private:
-    Platform::NoKill m_NoKill;
-};
-
-// Holds a connection's lock.
-class AutoAppLock {
-public:
-    explicit AutoAppLock(KorvelScript::Lock& lock) : m_Lock(lock) {
-        assert(!t_HasLocalLock && "a connection's lock comes before s_LocalLock");
-    }
-
-private:
-    Platform::NoKill m_NoKill;
-    KorvelScript::AutoLock m_Lock;
+// Holds s_LocalLock.
+struct AutoLocalLock : AutoPlacedLock {
+    AutoLocalLock() : AutoPlacedLock(LockRank::Exports, s_LocalLock) {}
 };
 
 // After four thousand million exports the numbers begin again.
@@ -88,6 +59,14 @@ ObjectRecord* FindKnownLocked(const ObjectRecord* record) {
     return known && known->m_Serial == record->m_Serial ? known : nullptr;
 }
 
+// The same as a question, which mostly spares a look at the other record.
+bool IsAliveLocked(ObjectRecord* record) {
+    if (record->m_SeenAt == s_NumDeaths) return true;
+    if (!FindKnownLocked(record)) return false;
+    record->m_SeenAt = s_NumDeaths;
+    return true;
+}
+
 void CountUp(ObjectRecord* record) {
     if (record->m_Count != kStuckCount) record->m_Count++;
 }
@@ -98,11 +77,6 @@ void TraceLocalToRemote(const RemoteApp& app, uint64_t address, uint32_t id) {
     if (id) snprintf(result, sizeof result, "%u", id);
     printf("App %p, %lld: LocalToRemote(%p) -> %s\n", static_cast<const void*>(&app),
            static_cast<long long>(app.GetID()), reinterpret_cast<void*>(address), result);
-}
-
-ScriptObject* GetRootObject() {
-    ScriptConfig* config = g_ScriptConfig.load(std::memory_order_acquire);
-    return config && config->GetApp ? config->GetApp(config->m_UserData, nullptr) : nullptr;
 }
 
 }  // namespace
@@ -131,7 +105,7 @@ struct RemoteApp::Tables {
 
 void RemoteApp::InitReferences() {
     if (!m_Tables) m_Tables = new Tables;
-    ScriptObject* root = GetRootObject();
+    ScriptObject* root = GetAppObject();
     if (!ObjectReferences::AddObjectReference(root)) root = nullptr;  // its death must be noticed
     if (root) root->IncRef();
     ScriptObject* old = nullptr;
@@ -143,38 +117,55 @@ void RemoteApp::InitReferences() {
             old = RemoveExportLocked(std::exchange(record, nullptr));
         }
         if (!record && AddExportLocked(root, kRootID)) root = nullptr;
-        if (!m_Tables->m_Remote.Find(kRootID)) {
-            m_Tables->m_Remote.Add(kRootID, this, false, nullptr);
-        }
+        // A thread that is counting it keeps it.
+        if (record && record->m_Object == root) record->m_IsLeaving = false;
     }
+    DetachProxies();
     if (root) root->DecRef();
     if (old) old->DecRef();
 }
 
+// What the last peer has given leads to nobody now, whatever number it had.
+void RemoteApp::DetachProxies() {
+    AutoAppLock guard(m_Lock);
+    ObjectTable& proxies = m_Tables->m_Remote;
+    for (RemoteObjectChunk* chunk = proxies.GetChunks(); chunk; chunk = chunk->m_Next) {
+        for (ObjectRecord& proxy : *chunk) {
+            if (proxy.m_ID && proxy.m_ID != kRootID && !proxy.m_IsDetached) proxies.Detach(&proxy);
+        }
+    }
+    if (!proxies.Find(kRootID)) proxies.Add(kRootID, this, false, nullptr);
+}
+
+uint32_t RemoteApp::NumberOf(const RemoteObject& proxy) const {
+    AutoAppLock guard(m_Lock);
+    return static_cast<const ObjectRecord&>(proxy).m_IsDetached ? kNoID : proxy.m_ID;
+}
+
 void RemoteApp::HoldRoot() {
-    InitReferences();
     if (ScriptObject* root = HoldLocalObject(kRootID)) {
         _IncLocalRef(root);
         root->DecRef();
     }
+    AutoAppLock guard(m_Lock);
+    m_Traffic->m_IsServing = true;
 }
 
 // Objects of this process
 
 // The record of an object that lives; stale ones of its address do not count.
 ObjectRecord* RemoteApp::FindExportLocked(const ScriptObject* object) const {
-    ObjectRecord* record = m_Tables->m_Local.Find(object);
-    while (record && !FindKnownLocked(record)) record = ObjectTable::FindNext(record);
-    return record;
+    return m_Tables->m_Local.FindIf(object, IsAliveLocked);
 }
 
 // A record that holds the caller's IncRef from here on. `id` 0 stands for the number that the
 // object has or gets. Null without memory.
 ObjectRecord* RemoteApp::AddExportLocked(ScriptObject* object, uint32_t id) {
     if (!object) return m_Tables->m_Local.Add(id, this, true, nullptr);
-    ObjectRecord* known = id ? s_LocalObjectList.Find(object, id) : s_LocalObjectList.Find(object);
     // Another connection may have made it number 1, which is a different object on this one.
-    if (known && m_Tables->m_Local.Find(known->m_ID)) known = nullptr;
+    ObjectRecord* known = s_LocalObjectList.FindIf(object, [&](const ObjectRecord* record) {
+        return id ? record->m_ID == id : !m_Tables->m_Local.Find(record->m_ID);
+    });
     if (!known) {
         known = s_LocalObjectList.Add(id ? id : TakeNextIDLocked(), nullptr, true, object);
         if (!known) return nullptr;
@@ -186,6 +177,7 @@ ObjectRecord* RemoteApp::AddExportLocked(ScriptObject* object, uint32_t id) {
         record->m_Type = known->m_Type;
         record->m_Known = known;
         record->m_Serial = known->m_Serial;
+        record->m_SeenAt = s_NumDeaths;
         known->m_Count++;
     } else if (!known->m_Count) {
         s_LocalObjectList.Remove(known);
@@ -202,11 +194,11 @@ ScriptObject* RemoteApp::RemoveExportLocked(ObjectRecord* record) {
     return object;
 }
 
-// One more reference to an object that is exported. One that is not is added if the caller `held`
-// it by an IncRef: this is then null, the record has it.
-ObjectRecord* RemoteApp::CountExport(ScriptObject* object, ScriptObject** held) {
+// One more reference to an object that is exported, in the run with a number or in any. One that is
+// not is added if the caller `held` it by an IncRef: this is then null, the record has it.
+ObjectRecord* RemoteApp::CountExport(ScriptObject* object, uint16_t run, ScriptObject** held) {
     AutoAppLock guard(m_Lock);
-    if (!Connected()) return nullptr;
+    if (!Connected() || (run && run != m_Traffic->m_Run)) return nullptr;
     AutoLocalLock localGuard;
     ObjectRecord* record = FindExportLocked(object);
     if (!record) {
@@ -223,16 +215,28 @@ ObjectRecord* RemoteApp::CountExport(ScriptObject* object, ScriptObject** held) 
     return record;
 }
 
-RemoteObject* RemoteApp::_IncLocalRef(void* pointer) {
-    auto* object = static_cast<ScriptObject*>(pointer);
+RemoteObject* RemoteApp::_IncLocalRef(void* object) {
+    return IncLocal(static_cast<ScriptObject*>(object), 0);
+}
+
+RemoteObject* RemoteApp::IncLocal(ScriptObject* object, uint16_t run) {
     if (!object) return nullptr;
-    if (ObjectRecord* record = CountExport(object, nullptr)) return record;
+    if (ObjectRecord* record = CountExport(object, run, nullptr)) return record;
     if (!Connected() || !ObjectReferences::AddObjectReference(object)) return nullptr;
     object->IncRef();
     ScriptObject* held = object;
-    ObjectRecord* record = CountExport(object, &held);
+    ObjectRecord* record = CountExport(object, run, &held);
+    // Its owner may have taken it back just before: its death must be noticed all the same.
+    if (record) ObjectReferences::AddObjectReference(object);
     if (held) held->DecRef();
     return record;
+}
+
+uint32_t RemoteApp::Export(ScriptObject* object, uint16_t run) {
+    RemoteObject* record = IncLocal(object, run);
+    if (!record) return 0;
+    AutoAppLock guard(m_Lock);
+    return record->m_Object == object ? record->m_ID : 0;
 }
 
 // Takes up to `count` references off. With the last the record goes, or with its last pin.
@@ -283,7 +287,7 @@ bool RemoteApp::DropLocalRefs(unsigned long long id) {
         AutoLocalLock localGuard;
         ObjectRecord* record = m_Tables->m_Local.Find(id);
         if (!record || record->m_IsLeaving) return false;
-        isAlive = !record->m_Object || FindKnownLocked(record);
+        isAlive = !record->m_Object || IsAliveLocked(record);
         released = DropExportLocked(record, kAllCounts);
     }
     Finish(released);
@@ -299,7 +303,7 @@ ScriptObject* RemoteApp::HoldObject(unsigned long long id, RemoteObject*& found)
         record = m_Tables->m_Local.Find(id);
         if (!record || record->m_IsLeaving) return nullptr;
         object = record->m_Object;
-        if (object && !FindKnownLocked(record)) return nullptr;
+        if (object && !IsAliveLocked(record)) return nullptr;
         found = record;
         if (!object) return nullptr;
         record->m_Pins++;
@@ -333,9 +337,9 @@ ScriptObject* RemoteApp::HoldLocalObject(unsigned long long id) {
 
 // The address is looked up before anything is done with it. An object that its owner destroys at
 // this moment is as unsafe as for any other thread that uses it.
-RemoteObject* RemoteApp::ExportAddress(unsigned long long address) {
+uint32_t RemoteApp::ExportAddress(unsigned long long address) {
     auto* object = reinterpret_cast<ScriptObject*>(static_cast<uintptr_t>(address));
-    return ObjectReferences::GetObjectReference(object) ? _IncLocalRef(object) : nullptr;
+    return ObjectReferences::GetObjectReference(object) ? Export(object, 0) : 0;
 }
 
 ScriptObject* RemoteApp::GetObjectPtr(unsigned long long id) {
@@ -346,7 +350,7 @@ ScriptObject* RemoteApp::GetObjectPtr(unsigned long long id) {
 
 // Removes all records that no peer is in the middle of counting, a chunk at a time. Returns the
 // uses of this connection that they held.
-uint32_t RemoteApp::ReleaseExports() {
+uint32_t RemoteApp::ReleaseExports(uint16_t run) {
     uint32_t numUses = 0;
     RemoteObjectChunk* chunk;
     {
@@ -358,9 +362,9 @@ uint32_t RemoteApp::ReleaseExports() {
         int count = 0;
         {
             AutoAppLock guard(m_Lock);
-            if (Connected()) break;
+            if (!HasEndedLocked(run)) break;
             AutoLocalLock localGuard;
-            for (ObjectRecord& record : chunk->m_Objects) {
+            for (ObjectRecord& record : *chunk) {
                 if (!record.m_ID || record.m_IsLeaving) continue;
                 Released released = DropExportLocked(&record, kAllCounts);
                 if (released.m_Object) objects[count++] = released.m_Object;
@@ -372,14 +376,23 @@ uint32_t RemoteApp::ReleaseExports() {
     return numUses;
 }
 
-void RemoteApp::CleanUpReferences() {
-    uint32_t numUses = ReleaseExports();
-    if (numUses) OnZeroLocalCount();
+bool RemoteApp::HasEndedLocked(uint16_t run) const {
+    return !Connected() && m_Traffic->m_Run == run;
+}
+
+void RemoteApp::Cleanup(uint16_t run) {
+    uint32_t numUses = ReleaseExports(run);
+    bool isLast = false;
+    if (numUses) {
+        AutoAppLock guard(m_Lock);
+        isLast = HasEndedLocked(run);
+    }
+    if (isLast) OnZeroLocalCount();
     while (numUses--) Recycle();
 }
 
 void RemoteApp::FreeReferences() {
-    ReleaseExports();
+    ReleaseExports(GetRun());
     delete std::exchange(m_Tables, nullptr);
 }
 
@@ -394,61 +407,101 @@ void RemoteApp::OnZeroRemoteCount() {
 void RemoteApp::EndIfUnused() {
     {
         AutoAppLock guard(m_Lock);
-        if (m_LocalCount || m_RemoteCount) return;
+        // A run that has just begun has not counted number 1 yet.
+        if (m_LocalCount || m_RemoteCount || !m_Traffic->m_IsServing) return;
     }
     Disconnect();
 }
 
 // Proxies
 
-RemoteObject* RemoteApp::CountProxy(unsigned long long id, bool canAdd) {
-    if (!id || id > UINT32_MAX) return nullptr;
-    AutoAppLock guard(m_Lock);
-    ObjectTable& table = m_Tables->m_Remote;
-    ObjectRecord* record = table.Find(id);
-    if (!record && canAdd) record = table.Add(static_cast<uint32_t>(id), this, false, nullptr);
-    if (!record) return nullptr;
+void RemoteApp::CountProxyLocked(ObjectRecord* record) {
     if (!record->m_Count) {
         m_RemoteCount++;
         Use();
     }
     CountUp(record);
+}
+
+RemoteObject* RemoteApp::CountProxy(unsigned long long id, uint16_t run, bool canAdd) {
+    if (!id || id > UINT32_MAX) return nullptr;
+    AutoAppLock guard(m_Lock);
+    if (run && run != m_Traffic->m_Run) return nullptr;
+    ObjectTable& table = m_Tables->m_Remote;
+    ObjectRecord* record = table.Find(id);
+    if (!record && canAdd) record = table.Add(static_cast<uint32_t>(id), this, false, nullptr);
+    if (record) CountProxyLocked(record);
     return record;
 }
 
 RemoteObject* RemoteApp::IncRemoteRef(unsigned long long id) {
-    return CountProxy(id, true);
+    return CountProxy(id, 0, true);
 }
 
-void RemoteApp::DecRemoteRef(unsigned long long id) {
-    bool isConnected;
-    bool wasLast;
-    {
-        AutoAppLock guard(m_Lock);
-        ObjectRecord* record = m_Tables->m_Remote.Find(id);
-        if (!record || !record->m_Count || record->m_Count == kStuckCount) return;
-        if (--record->m_Count) return;
-        m_Tables->m_Remote.Remove(record);
-        wasLast = --m_RemoteCount == 0;
-        isConnected = Connected();
+RemoteObject* RemoteApp::Import(uint32_t id, uint16_t run) {
+    return CountProxy(id, run, true);
+}
+
+// A proxy that has been taken out of its table.
+struct RemoteApp::DroppedProxy {
+    uint32_t m_ID = 0;  // 0 when it stays
+    uint16_t m_Run = 0;
+    bool m_WasLast = false;
+};
+
+RemoteApp::DroppedProxy RemoteApp::DropProxyLocked(ObjectRecord* record) {
+    if (!record || !record->m_Count || record->m_Count == kStuckCount) return {};
+    if (--record->m_Count) return {};
+    uint32_t id = NumberOf(*record);
+    m_Tables->m_Remote.Remove(record);
+    return {id, m_Traffic->m_Run, --m_RemoteCount == 0};
+}
+
+void RemoteApp::Finish(const DroppedProxy& dropped) {
+    if (!dropped.m_ID) return;
+    // What nobody can name counts for nobody.
+    Packet* packet = dropped.m_ID != kNoID && Connected()
+                         ? CreatePkt(PKT_NoMoreRefs, this, nullptr, nullptr)
+                         : nullptr;
+    if (packet) {
+        packet->m_Target = dropped.m_ID;
+        packet->m_Reserved = dropped.m_Run;
+        if (!DoPktAsync(packet, nullptr, nullptr)) FreePkt(packet);
     }
-    if (isConnected) {
-        Packet* packet = CreatePkt(PKT_NoMoreRefs, this, nullptr, nullptr);
-        if (packet) {
-            packet->m_Target = static_cast<uint32_t>(id);
-            if (!DoPktAsync(packet, nullptr, nullptr)) FreePkt(packet);
-        }
-    }
-    if (wasLast) OnZeroRemoteCount();
+    if (dropped.m_WasLast) OnZeroRemoteCount();
     Recycle();
 }
 
+void RemoteApp::DecRemoteRef(unsigned long long id) {
+    DroppedProxy dropped;
+    {
+        AutoAppLock guard(m_Lock);
+        dropped = DropProxyLocked(m_Tables->m_Remote.Find(id));
+    }
+    Finish(dropped);
+}
+
+// By the record: when its run has ended, its number may be another one's.
+void RemoteApp::IncProxy(RemoteObject* proxy) {
+    AutoAppLock guard(m_Lock);
+    CountProxyLocked(static_cast<ObjectRecord*>(proxy));
+}
+
+void RemoteApp::DecProxy(RemoteObject* proxy) {
+    DroppedProxy dropped;
+    {
+        AutoAppLock guard(m_Lock);
+        dropped = DropProxyLocked(static_cast<ObjectRecord*>(proxy));
+    }
+    Finish(dropped);
+}
+
 ScriptVal RemoteApp::FindRemoteObject(unsigned long long id) {
-    RemoteObject* proxy = CountProxy(id, false);
+    RemoteObject* proxy = CountProxy(id, 0, false);
     if (!proxy) return {};
     ScriptVal value;
     value.Set(SV_RemoteObject, &proxy);
-    DecRemoteRef(id);  // the value has a count of its own
+    DecProxy(proxy);  // the value has a count of its own
     return value;
 }
 
@@ -459,12 +512,14 @@ RemoteObject* RemoteApp::LocalToRemote(unsigned long long address) {
         packet->m_Target = static_cast<uint32_t>(address >> 32);
     }
     uint32_t id = 0;
+    RemoteObject* proxy = nullptr;
     if (Packet* reply = ExchangePkt(packet)) {
         id = reply->m_Target;
+        proxy = IncRemoteRef(id);  // ahead of DropPkt, which counts it, too, and lets go of it
         DropPkt(this, reply);
     }
     if (GetFlags() & PKF_Trace) TraceLocalToRemote(*this, address, id);
-    return IncRemoteRef(id);
+    return proxy;
 }
 
 // What values and objects ask
@@ -482,18 +537,26 @@ bool ForgetExports(ScriptObject* object, bool dropCounts) {
             count += known->m_Count;
             s_LocalObjectList.Remove(known);
         }
+        s_NumDeaths += isKnown;
     }
     while (dropCounts && count--) object->DecRef();
     return isKnown;
 }
 
-// The pointer of a proxy only tells that the object is of this process; it may have died.
+// The pointer of a proxy tells that the object was of this process when the proxy came; it may have
+// died, and the connection may since have been made to another process.
 ScriptObject* GetLocalPointer(RemoteObject* proxy) {
-    return proxy->m_Object ? RemoteApp::GetObjectPtr(proxy->m_ID) : nullptr;
+    RemoteApp* app = proxy->m_App;
+    {
+        AutoAppLock guard(app->GetLock());
+        if (!proxy->m_Object || app->GetSocket() != kInProcess) return nullptr;
+    }
+    return RemoteApp::GetObjectPtr(proxy->m_ID);
 }
 
+// A connection has one proxy for each number.
 bool IsSameRemote(RemoteObject* a, RemoteObject* b) {
-    return a == b || (a->m_App == b->m_App && a->m_ID == b->m_ID && a->m_Object == b->m_Object);
+    return a == b;
 }
 
 const bool s_HasHooks = [] {

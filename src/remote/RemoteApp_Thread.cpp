@@ -1,19 +1,15 @@
 // The thread of a connection: it reads, writes, serves and wakes those who wait, until the peer has
 // closed or it is told to end. It holds no lock while it does any of that; the lock guards the
 // queues and tables for the moment of a look.
-#include <sched.h>
-
 #include <algorithm>
-#include <cerrno>
 #include <climits>
 #include <cstring>
 #include <utility>
 
-#include "Platform/Events.h"
 #include "Platform/Networking.h"
-#include "Platform/NoKillInternal.h"
-#include "Platform/Threads.h"
+#include "Platform/NetworkingInternal.h"
 #include "core/0ReusePool.h"
+#include "diag/Env.h"
 #include "remote/RemoteApp.h"
 #include "remote/TrafficInternal.h"
 
@@ -24,100 +20,17 @@ constexpr unsigned int kSocketEvents = Platform::SE_READ | Platform::SE_CLOSE;
 constexpr unsigned int kMaxSleepMs = 1000;
 constexpr int64_t kMaxDelayMs = 10000;
 constexpr int64_t kQuitLimitNs = 1000 * kNsPerMs;  // that the peer has after our end of sending
-constexpr int kReadsInARow = 16;                   // before writing has its turn
+constexpr int kStepsInARow = 16;                   // before something else has its turn
 constexpr uint32_t kFirstCapacity = 262144;        // of a large packet that has only begun
+constexpr uint32_t kMostThreshold = 131072;        // of bytes to wait for
+constexpr int64_t kCheckNs = 1000 * kNsPerMs;      // between looks at how the peer does
 
-std::atomic<unsigned int> s_NumConnections{0};
+EnvInt s_StalledQueueSize("KORVEL_StalledQueueSize", true, 64);  // in MiB
+EnvInt s_StallSeconds("KORVEL_StallSeconds", true, 60);
+
+constexpr char kNoMemoryForPacket[] = "there is no memory for a packet";
 
 }  // namespace
-
-unsigned int GetNumConnections() {
-    return s_NumConnections;
-}
-
-// Connecting
-
-bool RemoteApp::Connect(Platform::_Socket* socket) {
-    _Disconnect(Platform::kNoTimeLimit);
-    CleanUpReferences();
-    Platform::SetSocketNonBlocking(socket, true);
-    Platform::SetSocketNoDelay(socket, true);
-    KorvelScript::AutoLock guard(m_Lock);
-    m_Traffic->m_Socket = socket;
-    if (StartThread()) return true;
-    m_Traffic->m_Socket = nullptr;
-    Platform::DeleteSocket(socket);
-    return false;
-}
-
-bool RemoteApp::Join(RemoteApp* a, RemoteApp* b) {
-    if (!a || !b || a == b || a->Connected() || b->Connected()) return false;
-    for (auto [self, peer] : {std::pair(a, b), std::pair(b, a)}) {
-        KorvelScript::AutoLock guard(self->m_Lock);
-        peer->Use();
-        self->m_Traffic->m_Peer = peer;
-        self->m_Traffic->m_Socket = kInProcess;
-    }
-    bool isStarted = true;
-    for (RemoteApp* app : {a, b}) {
-        KorvelScript::AutoLock guard(app->m_Lock);
-        isStarted = isStarted && app->StartThread();
-    }
-    if (isStarted) return true;
-    // TODO(remote): one of the two threads may run; it ends with its peer.
-    a->_Disconnect(0);
-    return false;
-}
-
-// Under the lock.
-bool RemoteApp::StartThread() {
-    Traffic& traffic = *m_Traffic;
-    if (traffic.m_Thread) {  // of a run that has ended
-        Platform::DeleteThread(std::exchange(traffic.m_Thread, nullptr));
-    }
-    Platform::DeleteSocketSet(traffic.m_Set);
-    traffic.m_Set = Platform::NewSocketSet(3);
-    if (!traffic.m_Set) return false;
-    traffic.m_WakeEvent = static_cast<unsigned int>(Platform::AddSocketSet(traffic.m_Set, 0, 0));
-    traffic.m_SocketEntry = 0;
-    if (traffic.m_Socket != kInProcess) {
-        traffic.m_SocketEntry = static_cast<int>(
-            Platform::AddSocketSet(traffic.m_Set, traffic.m_Socket, kSocketEvents));
-        if (!traffic.m_Input)
-            traffic.m_Input =
-                static_cast<unsigned char*>(g_ReusePoolMgr.Alloc(Traffic::kInputSize));
-        if (!traffic.m_Input || !traffic.m_SocketEntry) return false;
-    }
-    traffic.m_MustQuit = traffic.m_MustClose = traffic.m_WantsEnd = false;
-    traffic.m_QuitLimitNs = traffic.m_HeldUntilNs = 0;
-    traffic.m_NumInput = traffic.m_NumWritten = traffic.m_NumRead = traffic.m_NumUnanswered = 0;
-    Use();
-    auto start = [](void* app) -> unsigned long long {
-        Platform::SetThreadName("RemoteApp", nullptr);
-        static_cast<RemoteApp*>(app)->AppThreadFunc();
-        static_cast<RemoteApp*>(app)->Recycle();
-        return 0;
-    };
-    unsigned long long id;
-    traffic.m_Thread = Platform::NewThread(start, this, 0, &id);
-    if (!traffic.m_Thread) {
-        Recycle();
-        return false;
-    }
-    traffic.m_IsRunning = true;
-    s_NumConnections++;
-    return true;
-}
-
-void RemoteApp::AppThreadFunc() {
-    m_Traffic->m_ThreadID = Platform::GetCurrentThreadID();
-    { KorvelScript::AutoLock wait(m_Lock); }  // until the start is complete
-    HoldRoot();
-    do {
-        Sleep();
-    } while (Serve());
-    CloseDown();
-}
 
 // Waiting for something to do
 
@@ -128,12 +41,12 @@ unsigned int RemoteApp::GetSleepMs() {
     if (traffic.m_QuitLimitNs) limit = std::min(limit, traffic.m_QuitLimitNs);
     RemoteApp* writer = this;
     {
-        KorvelScript::AutoLock guard(m_Lock);
+        AutoAppLock guard(m_Lock);
         limit = std::min(limit, traffic.m_NextDeadlineNs);
         if (traffic.m_Peer) writer = traffic.m_Peer;
     }
     {
-        KorvelScript::AutoLock guard(writer->m_Lock);
+        AutoAppLock guard(writer->m_Lock);
         if (writer->m_Traffic->m_HeldUntilNs) {
             limit = std::min(limit, writer->m_Traffic->m_HeldUntilNs);
         }
@@ -145,20 +58,16 @@ unsigned int RemoteApp::GetSleepMs() {
 // Returns when there may be something to do.
 void RemoteApp::Sleep() {
     Traffic& traffic = *m_Traffic;
-    if (int64_t budget = traffic.m_Look.GetBudgetNs()) {
-        int64_t limit = NowNs() + budget;
-        bool found;
-        while (!(found = traffic.m_HasWork.exchange(false) ||
-                         (traffic.m_SocketEntry && Platform::WaitSocketSet(traffic.m_Set, 0))) &&
-               NowNs() < limit) {
-            sched_yield();
-        }
-        traffic.m_Look.Note(found);
-        if (found) return;
-    }
+    auto find = [&] {
+        return traffic.m_HasWork.exchange(false) ||
+               (traffic.m_SocketEntry && Platform::WaitSocketSet(traffic.m_Set, 0) > 0);
+    };
+    if (traffic.m_Look.Look(find)) return;
     traffic.m_IsAsleep = true;
     // From here on whoever brings work wakes us.
-    if (!traffic.m_HasWork) Platform::WaitSocketSet(traffic.m_Set, GetSleepMs());
+    if (!traffic.m_HasWork && Platform::WaitSocketSet(traffic.m_Set, GetSleepMs()) < 0) {
+        Close("the system does not wait for it");
+    }
     traffic.m_IsAsleep = false;
     traffic.m_HasWork = false;
 }
@@ -171,41 +80,48 @@ bool RemoteApp::Serve() {
         Platform::ShutdownSocket(traffic.m_Socket, 2);
         traffic.m_QuitLimitNs = NowNs() + kQuitLimitNs;
     }
-    if (traffic.m_QuitLimitNs && NowNs() >= traffic.m_QuitLimitNs) return false;
-    bool isOpen = true;
+    int64_t now = NowNs();
+    if (traffic.m_QuitLimitNs && now >= traffic.m_QuitLimitNs) return false;
     if (traffic.m_SocketEntry) {
         // A wake-up hides what the socket has to say, and an error has no event of its own: so
         // there is always a look.
         DoWrite();
-        isOpen = ReadSocket();
+        DoRead();
         DoWrite();
     } else {
-        ReadPeer();
-        KorvelScript::AutoLock guard(m_Lock);
-        isOpen = traffic.m_Peer != nullptr;
+        DoRead();
     }
-    EndOverdue();
-    return isOpen && !traffic.m_MustClose && !IsIdle();
+    EndOverdue(now);
+    if (traffic.m_SocketEntry && now >= traffic.m_NextCheckNs) CheckPeer(now);
+    return !traffic.m_HasEnded && !traffic.m_WhyClosed && !IsIdle();
 }
 
 // Disconnect has been called, and nothing is under way.
-bool RemoteApp::IsIdle() {
-    KorvelScript::AutoLock guard(m_Lock);
+bool RemoteApp::IsIdle() const {
+    AutoAppLock guard(m_Lock);
     const Traffic& traffic = *m_Traffic;
-    return traffic.m_WantsEnd && !traffic.m_Requests.GetCount() && !traffic.m_NumUnanswered &&
+    // One that has been refused need not answer.
+    bool isAnswered =
+        traffic.m_IsRefused || (!traffic.m_Requests.GetCount() && !traffic.m_NumSilent);
+    return traffic.m_WantsEnd && isAnswered && !traffic.m_NumUnanswered &&
            traffic.m_Outgoing.IsEmpty() && !traffic.m_Writing;
 }
 
 // Writing
 
-// The first packet whose time has come; else null, and how long it takes.
-Packet* RemoteApp::TakeOutgoing() {
-    Platform::NoKill noKill;
-    KorvelScript::AutoLock guard(m_Lock);
+Packet* RemoteApp::GetNextSendPacket() {
+    return TakeFor(nullptr, true);
+}
+
+// The first packet whose time has come; else null, and it is noted how long that takes. It is for
+// the peer within the process, or for a socket; where it may not wait, for one without a delay.
+Packet* RemoteApp::TakeFor(const RemoteApp* peer, bool mayWait) {
+    AutoAppLock guard(m_Lock);
     Traffic& traffic = *m_Traffic;
     Packet* first = traffic.m_Outgoing.First();
-    if (!first) return nullptr;
+    if (!first || traffic.m_Peer != peer) return nullptr;
     if (first->m_Delay) {
+        if (!mayWait) return nullptr;
         int64_t now = NowNs();
         if (!traffic.m_HeldUntilNs) {
             int64_t delayMs = std::min<int64_t>(first->m_Delay, kMaxDelayMs);
@@ -214,42 +130,60 @@ Packet* RemoteApp::TakeOutgoing() {
         if (now < traffic.m_HeldUntilNs) return nullptr;
         traffic.m_HeldUntilNs = 0;
     }
-    return traffic.m_Outgoing.Take();
+    traffic.m_Outgoing.Take();
+    if (peer && traffic.m_WantsEnd && traffic.m_Outgoing.IsEmpty()) Wake();
+    return first;
 }
 
+// A packet with another one behind it waits in the system for that, so that both travel together.
 void RemoteApp::DoWrite() {
     Traffic& traffic = *m_Traffic;
-    while (traffic.m_Writing || (traffic.m_Writing = TakeOutgoing())) {
-        uint32_t left = traffic.m_Writing->m_Size - traffic.m_NumWritten;
-        int written = WriteData(reinterpret_cast<char*>(traffic.m_Writing) + traffic.m_NumWritten,
-                                static_cast<int>(std::min<uint32_t>(left, INT_MAX)));
-        if (written <= 0) break;
-        traffic.m_NumWritten += static_cast<uint32_t>(written);
-        if (traffic.m_NumWritten < traffic.m_Writing->m_Size) break;
-        FreePkt(std::exchange(traffic.m_Writing, nullptr));
-        traffic.m_NumWritten = 0;
+    for (int i = 0; !traffic.m_QuitLimitNs; i++) {
+        if (!traffic.m_Writing) traffic.m_Writing = GetNextSendPacket();
+        if (!traffic.m_Writing) break;
+        if (i == kStepsInARow) {
+            traffic.m_HasWork = true;
+            break;
+        }
+        if (!traffic.m_Following) traffic.m_Following = TakeFor(nullptr, false);
+        if (!WriteSome()) break;
     }
-    // An error shows when reading.
+    // An error shows when reading. Once it is shut, a socket is ready for writing all the time.
     unsigned int events = kSocketEvents;
-    if (traffic.m_Writing) events |= Platform::SE_WRITE;
+    if (traffic.m_Writing && !traffic.m_QuitLimitNs) events |= Platform::SE_WRITE;
     Platform::ModifySocketSetEvents(traffic.m_Set, traffic.m_SocketEntry, events);
+}
+
+// Of the packet that is being written; false when the socket takes no more.
+bool RemoteApp::WriteSome() {
+    Traffic& traffic = *m_Traffic;
+    char* rest = reinterpret_cast<char*>(traffic.m_Writing) + traffic.m_NumWritten;
+    int left = static_cast<int>(traffic.m_Writing->m_Size - traffic.m_NumWritten);
+    int written = traffic.m_Following
+                      ? static_cast<int>(Platform::SocketSendMore(traffic.m_Socket, rest, left))
+                      : WriteData(rest, left);
+    if (written <= 0) return false;
+    traffic.m_HasWritten = true;
+    traffic.m_NumWritten += static_cast<uint32_t>(written);
+    if (written < left) return false;
+    FreePkt(std::exchange(traffic.m_Writing, std::exchange(traffic.m_Following, nullptr)));
+    traffic.m_NumWritten = 0;
+    return true;
 }
 
 // Reading
 
 void RemoteApp::DoRead() {
-    if (m_Traffic->m_SocketEntry) {
-        ReadSocket();
-    } else {
-        ReadPeer();
-    }
+    bool isOpen = m_Traffic->m_SocketEntry ? ReadSocket() : ReadPeer();
+    if (!isOpen) m_Traffic->m_HasEnded = true;
 }
 
 // Takes what has arrived; false when the connection has ended, and all that came before the end has
 // been served.
 bool RemoteApp::ReadSocket() {
     Traffic& traffic = *m_Traffic;
-    for (int i = 0; i < kReadsInARow && !traffic.m_MustClose; i++) {
+    if (traffic.m_HasInput && !TakeInput()) return false;
+    for (int i = 0; i < kStepsInARow && !traffic.m_HasInput && !traffic.m_WhyClosed; i++) {
         bool isLarge = traffic.m_Reading != nullptr;
         unsigned char* place = traffic.m_Input + traffic.m_NumInput;
         uint32_t room = Traffic::kInputSize - traffic.m_NumInput;
@@ -257,56 +191,78 @@ bool RemoteApp::ReadSocket() {
             place = reinterpret_cast<unsigned char*>(traffic.m_Reading) + traffic.m_NumRead;
             room = traffic.m_Capacity - traffic.m_NumRead;
         }
-        errno = 0;  // an orderly end sets none
         int received = ReadData(place, static_cast<int>(room));
         if (received <= 0) return Platform::GetSocketError() == Platform::SERR_WOULDBLOCK;
         (isLarge ? traffic.m_NumRead : traffic.m_NumInput) += static_cast<uint32_t>(received);
         if (!(isLarge ? FinishReading() : TakeInput())) return false;
-        if (static_cast<uint32_t>(received) < room) return true;  // there was no more
+        if (isLarge || traffic.m_Reading) SetThreshold();
+        if (static_cast<uint32_t>(received) < room) break;  // there was no more
     }
+    if (traffic.m_HasInput) traffic.m_HasWork = true;  // when others have had their turn
     return true;
 }
 
-// Serves the packets in the input buffer; false when the stream is broken.
+// Of a large packet, many bytes are worth a wake-up.
+void RemoteApp::SetThreshold() {
+    Traffic& traffic = *m_Traffic;
+    uint32_t left = traffic.m_Reading ? traffic.m_Reading->m_Size - traffic.m_NumRead : 1;
+    int threshold = static_cast<int>(std::min(left, kMostThreshold));
+    if (threshold == traffic.m_Threshold) return;
+    if (Platform::SetSocketReadThreshold(traffic.m_Socket, threshold)) {
+        traffic.m_Threshold = threshold;
+    }
+}
+
+// Serves the packets in the input buffer, some of them at a time; false when the stream is broken.
 bool RemoteApp::TakeInput() {
     Traffic& traffic = *m_Traffic;
-    uint32_t used = 0;
-    while (!traffic.m_MustClose && !traffic.m_Reading) {
-        uint32_t left = traffic.m_NumInput - used;
+    for (int i = 0;; i++) {
+        uint32_t left = traffic.m_NumInput - traffic.m_NumUsed;
+        const unsigned char* bytes = traffic.m_Input + traffic.m_NumUsed;
         uint32_t size;
-        if (left < sizeof(size)) break;
-        const unsigned char* bytes = traffic.m_Input + used;
+        traffic.m_HasInput = left >= sizeof(size);
+        if (!traffic.m_HasInput) break;
         memcpy(&size, bytes, sizeof(size));
         if (size < kMinPacketSize || size > GetMaxPacketSize()) {
             Close("the peer sent a packet of an impossible size");
             return false;
         }
+        traffic.m_HasInput = left >= size;
         if (size > Traffic::kInputSize) {
-            // Memory grows with the bytes that have arrived, not with what is claimed.
-            traffic.m_Capacity = std::min(size, kFirstCapacity);
-            traffic.m_Reading = AllocPkt(traffic.m_Capacity);
-            if (!traffic.m_Reading) {
-                Close("there is no memory for a packet");
-                return false;
-            }
-            memcpy(static_cast<void*>(traffic.m_Reading), bytes, left);
-            traffic.m_NumRead = left;
-            used += left;
-        } else if (left < size) {
+            if (!BeginLarge(size, bytes, left)) return false;
             break;
-        } else {
-            Packet* packet = AllocPkt(size);
-            if (!packet) {
-                Close("there is no memory for a packet");
-                return false;
-            }
-            memcpy(static_cast<void*>(packet), bytes, size);
-            used += size;
-            DispatchPacket(packet);
         }
+        if (!traffic.m_HasInput) break;
+        bool mustQuit = traffic.m_MustQuit && !traffic.m_QuitLimitNs;
+        if (i == kStepsInARow || mustQuit || traffic.m_WhyClosed) return true;
+        Packet* packet = AllocPkt(size);
+        if (!packet) {
+            Close(kNoMemoryForPacket);
+            return false;
+        }
+        memcpy(static_cast<void*>(packet), bytes, size);
+        traffic.m_NumUsed += size;
+        DispatchPacket(packet);
     }
-    traffic.m_NumInput -= used;
-    memmove(traffic.m_Input, traffic.m_Input + used, traffic.m_NumInput);
+    traffic.m_NumInput -= traffic.m_NumUsed;
+    memmove(traffic.m_Input, traffic.m_Input + traffic.m_NumUsed, traffic.m_NumInput);
+    traffic.m_NumUsed = 0;
+    return true;
+}
+
+// Moves the beginning of a large packet to where the rest will go. Memory grows with the bytes that
+// have arrived, not with what is claimed.
+bool RemoteApp::BeginLarge(uint32_t size, const unsigned char* bytes, uint32_t length) {
+    Traffic& traffic = *m_Traffic;
+    traffic.m_Capacity = std::min(size, kFirstCapacity);
+    traffic.m_Reading = AllocPkt(traffic.m_Capacity);
+    if (!traffic.m_Reading) {
+        Close(kNoMemoryForPacket);
+        return false;
+    }
+    memcpy(static_cast<void*>(traffic.m_Reading), bytes, length);
+    traffic.m_NumRead = length;
+    traffic.m_NumUsed += length;
     return true;
 }
 
@@ -320,10 +276,10 @@ bool RemoteApp::FinishReading() {
         return true;
     }
     uint32_t capacity =
-        static_cast<uint32_t>(std::min<uint64_t>(size, uint64_t{traffic.m_Capacity} * 2));
+        static_cast<uint32_t>(std::min<uint64_t>(size, uint64_t{traffic.m_Capacity} * 4));
     Packet* larger = AllocPkt(capacity);
     if (!larger) {
-        Close("there is no memory for a packet");
+        Close(kNoMemoryForPacket);
         return false;
     }
     memcpy(static_cast<void*>(larger), traffic.m_Reading, traffic.m_NumRead);
@@ -333,20 +289,25 @@ bool RemoteApp::FinishReading() {
 }
 
 // Within the process, packets come from the peer's own queue.
-void RemoteApp::ReadPeer() {
-    RemoteApp* peer = m_Traffic->m_Peer;  // only this thread writes it
-    if (!peer) return;
-    while (Packet* packet = peer->TakeOutgoing()) DispatchPacket(packet);
+bool RemoteApp::ReadPeer() {
+    Traffic& traffic = *m_Traffic;
+    RemoteApp* peer = traffic.m_Peer;  // fixed while it runs
+    for (int i = 0; i < kStepsInARow && !traffic.m_WhyClosed && !traffic.m_MustQuit; i++) {
+        Packet* packet = peer->TakeFor(this, true);
+        if (!packet) return true;
+        DispatchPacket(packet);
+    }
+    traffic.m_HasWork = true;
+    return true;
 }
 
 // Ending
 
 // Asynchronous requests whose time has passed.
-void RemoteApp::EndOverdue() {
-    int64_t now = NowNs();
+void RemoteApp::EndOverdue(int64_t now) {
     Request* overdue;
     {
-        KorvelScript::AutoLock guard(m_Lock);
+        AutoAppLock guard(m_Lock);
         Traffic& traffic = *m_Traffic;
         if (now < traffic.m_NextDeadlineNs) return;
         traffic.m_NextDeadlineNs = INT64_MAX;
@@ -360,6 +321,37 @@ void RemoteApp::EndOverdue() {
     DropRequests(overdue);
 }
 
+// Ends the connection when the peer has vanished, or does not take what waits for it.
+void RemoteApp::CheckPeer(int64_t now) {
+    Traffic& traffic = *m_Traffic;
+    traffic.m_NextCheckNs = now + kCheckNs;
+
+    uint64_t queued;
+    {
+        AutoAppLock guard(m_Lock);
+        queued = traffic.m_Outgoing.GetBytes();
+    }
+    if (traffic.m_Writing) queued += traffic.m_Writing->m_Size;
+    bool isLong = queued > static_cast<uint64_t>(s_StalledQueueSize) << 20;
+    if (std::exchange(traffic.m_HasWritten, false) || !isLong) traffic.m_ProgressNs = now;
+    if (now - traffic.m_ProgressNs > s_StallSeconds * 1000 * kNsPerMs) {
+        Close("the peer takes nothing of what waits for it");
+    }
+
+    Platform::SocketSilence silence;
+    bool isOwed = Platform::GetSocketSilence(traffic.m_Socket, silence) && silence.m_IsOwed;
+    if (!isOwed) {
+        traffic.m_OwedSinceNs = 0;
+        return;
+    }
+    if (!traffic.m_OwedSinceNs) traffic.m_OwedSinceNs = now;
+    PeerTimeout timeout;
+    if (silence.m_Ms >= timeout.SilenceMs() &&
+        now - traffic.m_OwedSinceNs >= timeout.AskEvery() * 1000 * kNsPerMs) {
+        Close("the peer has vanished");
+    }
+}
+
 // Tells the callbacks of requests that there will be no reply.
 void RemoteApp::DropRequests(Request* requests) {
     while (Request* request = requests) {
@@ -367,40 +359,9 @@ void RemoteApp::DropRequests(Request* requests) {
         if (request->m_Callback) {
             request->m_Callback(request->m_Data, this, nullptr, request->m_Context);
         }
-        if (request->m_Reply) DropPkt(this, request->m_Reply);
+        FreePkt(request->m_Reply);  // its run is over, or it never came
         delete request;
     }
-}
-
-void RemoteApp::CloseDown() {
-    Traffic& traffic = *m_Traffic;
-    Platform::_Socket* socket;
-    RemoteApp* peer;
-    Request* requests;
-    {
-        KorvelScript::AutoLock guard(m_Lock);
-        traffic.m_IsRunning = false;
-        socket = std::exchange(traffic.m_Socket, nullptr);
-        peer = std::exchange(traffic.m_Peer, nullptr);
-        requests = traffic.m_Requests.TakeIf([](Request& request) {
-            if (!request.m_HasWaiter) return true;
-            request.m_IsOver = true;
-            request.m_Event.Signal();
-            return false;
-        });
-        while (Packet* packet = traffic.m_Outgoing.Take()) FreePkt(packet);
-    }
-    s_NumConnections--;
-    if (socket != kInProcess) Platform::DeleteSocket(socket);
-    if (peer) {
-        peer->m_Traffic->m_MustQuit = true;
-        peer->Wake();
-        peer->Recycle();
-    }
-    FreePkt(std::exchange(traffic.m_Writing, nullptr));
-    FreePkt(std::exchange(traffic.m_Reading, nullptr));
-    DropRequests(requests);
-    CleanUpReferences();
 }
 
 }  // namespace Korvel

@@ -6,6 +6,7 @@
 #include "objects/ScriptSymbol.h"
 #include "remote/Packets.h"
 #include "remote/RemoteApp.h"
+#include "remote/TrafficInternal.h"
 
 namespace Korvel {
 namespace {
@@ -21,9 +22,9 @@ void AppendWhere(const RemoteApp& app, ScriptVal& text) {
 }
 
 Packet* CreateCommand(RemoteObject* object, int op, const ScriptArgs& args) {
-    if (!object->m_App) return nullptr;
+    if (!object->m_App || object->m_IsLocal) return nullptr;  // the number is the peer's word
     Packet* packet = ScriptVal::ToPacket(object, op, nullptr, &args);
-    if (!packet) object->m_App->SetLastError(SCERR_Unknown, "Packet too large.");
+    if (!packet) object->m_App->SetLastError(SCERR_Unknown, kTooLarge);
     return packet;
 }
 
@@ -34,7 +35,7 @@ void RemoteObject::IncRef() {
     if (m_IsLocal) {
         m_App->_IncLocalRef(m_Object);
     } else {
-        m_App->IncRemoteRef(m_ID);
+        m_App->IncProxy(this);
     }
 }
 
@@ -43,26 +44,22 @@ void RemoteObject::DecRef() {
     if (m_IsLocal) {
         m_App->_DecLocalRef(m_Object);
     } else {
-        m_App->DecRemoteRef(m_ID);
+        m_App->DecProxy(this);
     }
 }
 
 ScriptVal RemoteObject::DoCommand(int op, ScriptArgs& args) {
     ScriptVal result;
-    return DoCommand(op, args, result) ? result : ScriptVal();
+    DoCommand(op, args, result);
+    return result;
 }
 
 bool RemoteObject::DoCommand(int op, ScriptArgs& args, ScriptVal& result) {
+    // What a packet names is counted from its making on, so none is made that could not be sent.
+    if (!m_App || !m_App->MayWait()) return false;
     Packet* packet = CreateCommand(this, op, args);
     if (!packet) return false;
-    Packet* reply = m_App->ExchangePkt(packet);
-    if (!reply) return false;
-    bool isValid = ScriptVal::FromPacket(this, reply, nullptr, &result);
-    FreePkt(reply);
-    if (!isValid) {
-        m_App->Close("the peer sent a reply with no valid values");
-        return false;
-    }
+    if (!m_App->Exchange(packet, result)) return false;
     if (op == SST_ToString && result.IsTable()) AppendWhere(*m_App, result[-1]);
     return true;
 }

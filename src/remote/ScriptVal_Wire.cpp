@@ -3,14 +3,11 @@
 #include <bit>
 #include <climits>
 #include <cmath>
-#include <cstdio>
 #include <cstring>
 #include <limits>
 #include <string_view>
 #include <utility>
 
-#include "Platform/Lock.h"
-#include "Platform/NoKillInternal.h"
 #include "core/ScriptHooksInternal.h"
 #include "core/ScriptValInternal.h"
 #include "objects/ScriptObject.h"
@@ -18,13 +15,13 @@
 #include "remote/RemoteApp.h"
 #include "remote/RemoteObject.h"
 #include "remote/ScriptPort.h"
+#include "remote/TrafficInternal.h"
 
 namespace Korvel {
 namespace {
 
 static_assert(std::endian::native == std::endian::little);
 
-constexpr uint32_t kNoObject = 0xffffffff;  // cannot be named on this connection
 constexpr uint32_t kUUIDLength = 36;
 constexpr uint32_t kMinEntrySize = 8;  // two nils
 
@@ -35,7 +32,7 @@ constexpr uint32_t kReceivedFlags[SV_Pointer + 1] = {
     0,                                              // SV_String
     0,                                              // SV_Boolean
     ~(SVF_TypeMask | SVF_ReadOnly | SVF_FromWire),  // SV_Table
-    0x500000,                                       // SV_Function: what kind of member it is
+    SVF_TableResult | SVF_AnyThreadFunc,            // SV_Function
 };
 
 // Adds the bytes that a value takes which has `depth` lists around it. False when lists nest too
@@ -124,7 +121,7 @@ unsigned char* PutObject(unsigned char* at, uint32_t id, const ScriptVal& uuid) 
 // place behind, so that it stays in a register.
 class Writer {
 public:
-    explicit Writer(RemoteApp* app) : m_App(app) {}
+    Writer(RemoteApp* app, uint16_t run) : m_App(app), m_Run(run) {}
 
     unsigned char* Write(unsigned char* at, const ScriptVal& value) const {
         if (!value.IsNumber()) return WriteOther(at, value);
@@ -139,6 +136,7 @@ private:
     uint32_t Export(const ScriptVal& value) const;
 
     RemoteApp* const m_App;
+    const uint16_t m_Run;  // 0 for any
 };
 
 unsigned char* Writer::WriteEntries(unsigned char* at, const ScriptVal& list) const {
@@ -191,19 +189,15 @@ unsigned char* Writer::WriteOther(unsigned char* at, const ScriptVal& value) con
 // A proxy has a meaning for its owner alone.
 uint32_t Writer::NumberOfProxy(const RemoteObject& proxy) const {
     bool isAtHome = m_App && proxy.m_App == m_App && m_App->Connected();
-    return isAtHome ? proxy.m_ID : kNoObject;
+    return isAtHome ? m_App->NumberOf(proxy) : kNoID;
 }
 
 // Counts an object for the peer.
 uint32_t Writer::Export(const ScriptVal& value) const {
     ScriptObject* object = value.ToLocalObject();
-    if (!m_App || !object || (value.m_Flags & SVF_Foreign)) return kNoObject;
-    // What is counted after a connection has given its counts back would stay for ever, so both
-    // steps are one.
-    Platform::NoKill noKill;
-    KorvelScript::AutoLock guard(m_App->GetLock());
-    RemoteObject* record = m_App->Connected() ? m_App->_IncLocalRef(object) : nullptr;
-    return record ? record->m_ID : kNoObject;
+    if (!m_App || !object || (value.m_Flags & SVF_Foreign)) return kNoID;
+    uint32_t id = m_App->Export(object, m_Run);
+    return id ? id : kNoID;
 }
 
 // Reads bytes of a peer. Nothing that it says is taken for granted; it recurses as deep as lists
@@ -213,26 +207,32 @@ class Reader {
 public:
     using Place = const unsigned char*;
 
-    Reader(RemoteApp* app, Place end) : m_App(app), m_End(end) {}
+    Reader(RemoteApp* app, uint16_t run, Place end) : m_App(app), m_Run(run), m_End(end) {}
 
     // Fills a nil that has `depth` lists around it.
     [[nodiscard]] Place Read(Place at, ScriptVal& value, int depth) const {
+        if (Left(at) < kNumberSize || !IsNumber(at)) return ReadOther(at, value, depth);
+        return GetNumber(at, value);
+    }
+
+private:
+    static constexpr size_t kNumberSize = 12;
+
+    size_t Left(Place at) const { return static_cast<size_t>(m_End - at); }
+
+    static bool IsNumber(Place at) { return *at == SV_Number; }
+    static Place GetNumber(Place at, ScriptVal& value) {
         uint32_t word;
         double number;
-        if (Left(at) < sizeof word + sizeof number) return ReadOther(at, value, depth);
         memcpy(&word, at, sizeof word);
-        if ((word & SVF_TypeMask) != SV_Number) return ReadOther(at, value, depth);
         memcpy(&number, at + sizeof word, sizeof number);
         // LuaJIT keeps its own pointers in NaNs, and scripts read numbers where they lie.
         if (std::isnan(number)) [[unlikely]]
             number = std::numeric_limits<double>::quiet_NaN();
         value.m_Flags = word & (SVF_TypeMask | SVF_Int);
         value.m_Value.m_Number = number;
-        return at + sizeof word + sizeof number;
+        return at + kNumberSize;
     }
-
-private:
-    size_t Left(Place at) const { return static_cast<size_t>(m_End - at); }
 
     template <class T>
     [[nodiscard]] Place Get(Place at, T& field) const {
@@ -254,6 +254,7 @@ private:
     bool IsInProcess() const { return m_App && m_App->GetSocket() == kInProcess; }
 
     RemoteApp* const m_App;
+    const uint16_t m_Run;  // 0 for any
     const Place m_End;
 };
 
@@ -347,10 +348,14 @@ Reader::Place Reader::ReadEntries(Place at, ScriptVal& list, int depth) const {
         if (!entry) return nullptr;
         last = *link = entry;
         link = &entry->m_Next;
-        at = Read(at, entry->m_Key, depth + 1);
-        if (at) at = Read(at, entry->m_Value, depth + 1);
-        if (!at) return nullptr;
-        if (!entry->m_Key.IsNumber()) continue;
+        if (Left(at) >= 2 * kNumberSize && IsNumber(at) && IsNumber(at + kNumberSize)) [[likely]] {
+            at = GetNumber(GetNumber(at, entry->m_Key), entry->m_Value);
+        } else {
+            at = Read(at, entry->m_Key, depth + 1);
+            if (at) at = Read(at, entry->m_Value, depth + 1);
+            if (!at) return nullptr;
+            if (!entry->m_Key.IsNumber()) continue;
+        }
         double number = entry->m_Key.m_Value.m_Number;
         if (number > greatest) [[likely]] {
             greatest = number;
@@ -407,29 +412,21 @@ Reader::Place Reader::ReadObject(Place at, ScriptVal& value, bool isOurs) const 
 }
 
 void Reader::FindOurs(ScriptVal& value, uint32_t id) const {
-    ScriptObject* object;
-    {
-        Platform::NoKill noKill;
-        KorvelScript::AutoLock guard(m_App->GetLock());
-        RemoteObject* record = m_App->FindLocalObject(id);
-        object = record ? record->m_Object : nullptr;
-    }
+    ScriptObject* object = m_App->HoldLocalObject(id);
     if (!object) return;
-    // The count of the look-up is the caller's, and becomes the value's.
     uint64_t ref = ObjectReferences::AddObjectReference(object);
     if (!ref) return object->DecRef();
     value.m_Flags = SV_LocalObject;
-    value.m_Value.m_LocalObject = {object, ref};
+    value.m_Value.m_LocalObject = {object, ref};  // with the count
 }
 
 void Reader::MakeProxy(ScriptVal& value, uint32_t id) const {
-    RemoteObject* proxy = m_App->IncRemoteRef(id);
+    RemoteObject* proxy = m_App->Import(id, m_Run);
     if (!proxy) return;
     value.m_Flags = SV_RemoteObject;
     value.m_Value.m_RemoteObject = proxy;
     if (!IsInProcess()) return;
-    Platform::NoKill noKill;
-    KorvelScript::AutoLock guard(m_App->GetLock());
+    AutoAppLock guard(m_App->GetLock());
     proxy->m_Object = RemoteApp::GetObjectPtr(id);
 }
 
@@ -471,24 +468,8 @@ private:
     ScriptVal m_Table;
 };
 
-// Results that are too large for a packet, or for the memory there is, become the error that tells
-// so: somebody waits for the reply.
-Packet* MakeReply(RemoteApp* app, uint32_t context, const ScriptVal* first,
-                  const ScriptVal& result) {
-    if (Packet* reply = CreateReply(context, app, first, &result)) return reply;
-    ScriptVal error(SV_Table, nullptr);
-    error.SetError(SCERR_Unknown, "Packet too large.");
-    return CreateReply(context, app, nullptr, &error);
-}
-
 bool IsTraced(RemoteApp* app, const ScriptVal& args) {
     return (app && (app->GetFlags() & PKF_Trace)) || (args.m_Flags & SVF_FromWire);
-}
-
-void Trace(uint32_t context, const ScriptVal& result) {
-    Platform::NoKill noKill;
-    printf("   <- [%u] ", context);
-    result.Dump();
 }
 
 // Whole milliseconds.
@@ -497,18 +478,10 @@ uint32_t DelayOf(const ScriptVal& args) {
     return static_cast<uint32_t>(std::clamp<long long>(delay, 0, UINT32_MAX));
 }
 
-void KeepError(RemoteApp* app, const ScriptVal& reply) {
-    const ScriptVal& error = reply.FindKeyConst("Error");
-    if (error.ToNumber() == 0) return;
-    // A number that is none of ours is no less an error.
-    long long number = error.ToInteger();
-    if (number <= 0 || number > INT_MAX) number = SCERR_Unknown;
-    app->SetLastError(static_cast<uint32_t>(number),
-                      reply.FindKeyConst("ErrorString").ToString(""));
-}
-
 bool SendReply(ScriptArgs& args) {
     RemoteApp* app = args.GetApp();
+    uint16_t run = args.m_Value.m_Args.m_Run;
+    if (run && app->GetRun() != run) return false;  // who has asked is gone
     Packet* reply = ScriptVal::ToReply(app, args.m_Value.m_Args.m_Context, nullptr, &args);
     if (!reply) return false;
     app->SendPkt(reply);
@@ -517,7 +490,29 @@ bool SendReply(ScriptArgs& args) {
 
 [[maybe_unused]] const bool s_IsHooked = (g_ScriptHooks.m_SendReply = SendReply, true);
 
+bool ReadValue(ScriptVal& value, RemoteApp* app, uint16_t run, unsigned char*& cursor,
+               const unsigned char* end) {
+    ScriptVal read;
+    const unsigned char* behind = Reader(app, run, end).Read(cursor, read, 0);
+    if (behind) {
+        cursor += behind - cursor;
+    } else {
+        read.CleanUp();
+    }
+    value = std::move(read);
+    return behind;
+}
+
 }  // namespace
+
+void RemoteApp::KeepError(const ScriptVal& results) {
+    const ScriptVal& error = results.FindKeyConst("Error");
+    if (error.ToNumber() == 0) return;
+    // A number that is none of ours is no less an error.
+    long long number = error.ToInteger();
+    if (number <= 0 || number > INT_MAX) number = SCERR_Unknown;
+    SetLastError(static_cast<uint32_t>(number), results.FindKeyConst("ErrorString").ToString(""));
+}
 
 uint32_t ScriptVal::CalcPktSize() const {
     uint64_t size = 0;
@@ -526,20 +521,17 @@ uint32_t ScriptVal::CalcPktSize() const {
 }
 
 bool ScriptVal::ToPkt(RemoteApp* app, unsigned char*& cursor) const {
-    cursor = Writer(app).Write(cursor, *this);
+    cursor = Writer(app, 0).Write(cursor, *this);
     return true;
 }
 
 bool ScriptVal::FromPkt(RemoteApp* app, unsigned char*& cursor, const unsigned char* end) {
-    ScriptVal read;
-    const unsigned char* behind = Reader(app, end).Read(cursor, read, 0);
-    if (behind) {
-        cursor += behind - cursor;
-    } else {
-        read.CleanUp();
-    }
-    *this = std::move(read);
-    return behind;
+    return ReadValue(*this, app, 0, cursor, end);
+}
+
+void WriteValues(Packet* packet, RemoteApp* app, const ScriptVal& first, const ScriptVal& second) {
+    Writer writer(app, static_cast<uint16_t>(packet->m_Reserved));
+    writer.Write(writer.Write(packet->Payload(), first), second);
 }
 
 Packet* ScriptVal::ToPacket(RemoteApp* app, uint32_t target, int symbol, const ScriptVal* first,
@@ -554,16 +546,19 @@ Packet* ScriptVal::ToPacket(RemoteApp* app, uint32_t target, int symbol, const S
 
 Packet* ScriptVal::ToPacket(RemoteObject* object, int symbol, const ScriptVal* first,
                             const ScriptVal* second) {
-    return object ? ToPacket(object->m_App, object->m_ID, symbol, first, second) : nullptr;
+    if (!object) return nullptr;
+    uint32_t target = object->m_App ? object->m_App->NumberOf(*object) : object->m_ID;
+    return ToPacket(object->m_App, target, symbol, first, second);
 }
 
 Packet* ScriptVal::ToReply(RemoteApp* app, uint32_t context, const ScriptVal* first,
                            ScriptVal* args) {
+    uint16_t run = args && args->IsArgs() ? args->m_Value.m_Args.m_Run : uint16_t{0};
     ResultTable result;
-    if (!args) return MakeReply(app, context, first, result.Get());
+    if (!args) return CreateReplyOrError(context, app, run, first, &result.Get());
     if (!result.BorrowResults(*args)) return nullptr;
-    if (IsTraced(app, *args)) Trace(context, result.Get());
-    Packet* reply = MakeReply(app, context, first, result.Get());
+    if (IsTraced(app, *args)) TraceValues("<-", context, result.Get());
+    Packet* reply = CreateReplyOrError(context, app, run, first, &result.Get());
     if (!reply) return nullptr;
     if (args->m_Flags & SVF_FromWire) reply->m_Flags |= PKF_Trace;
     reply->m_Delay = DelayOf(*args);
@@ -580,8 +575,10 @@ bool ScriptVal::FromPacket(RemoteApp* app, Packet* packet, ScriptVal* first, Scr
     unsigned char* cursor = packet->Payload();
     const unsigned char* end = packet->End();
     ScriptVal a, b;
-    if (!a.FromPkt(app, cursor, end) || !b.FromPkt(app, cursor, end) || cursor != end) return false;
-    if (packet->m_Type == PKT_Reply && app && b.IsTable()) KeepError(app, b);
+    auto run = static_cast<uint16_t>(packet->m_Reserved);
+    bool isValid = ReadValue(a, app, run, cursor, end) && ReadValue(b, app, run, cursor, end);
+    if (!isValid || cursor != end) return false;
+    if (packet->m_Type == PKT_Reply && app && second && b.IsTable()) app->KeepError(b);
     if (packet->m_Flags & PKF_Trace) b.m_Flags |= SVF_FromWire;
     if (first) *first = std::move(a);
     if (second) {

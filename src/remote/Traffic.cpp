@@ -1,3 +1,6 @@
+#include <sched.h>
+
+#include <algorithm>
 #include <ctime>
 #include <utility>
 
@@ -9,17 +12,40 @@ namespace Korvel {
 namespace {
 
 constexpr uint32_t kFirstBuckets = 16;
-constexpr int kMostCredit = 8;
-constexpr unsigned kTryEach = 32;  // times without credit, after which it is tried again
+constexpr unsigned kTryEach = 32;   // times without credit, after which it is tried again
+constexpr int64_t kTurnNs = 50000;  // that a thread with work of its own takes
 
-EnvInt s_PollMicroseconds("PollMicroseconds", false, 50);
+EnvInt s_PollMicroseconds("KORVEL_PollMicroseconds", true, 50);
+EnvInt s_MaxQueueSize("KORVEL_MaxQueueSize", true, 1024);  // in MiB
 
 }  // namespace
+
+uint64_t GetMaxQueueSize() {
+    return static_cast<uint64_t>(std::max<int64_t>(s_MaxQueueSize, 0)) << 20;
+}
 
 int64_t NowNs() {
     timespec now;
     clock_gettime(CLOCK_MONOTONIC, &now);
     return now.tv_sec * int64_t{1000000000} + now.tv_nsec;
+}
+
+int64_t DeadlineAfter(double seconds) {
+    constexpr double kFar = 1e9;  // some thirty years
+    return seconds > 0 && seconds < kFar ? NowNs() + static_cast<int64_t>(seconds * 1e9) : 0;
+}
+
+void Waiter::Wait(int64_t deadlineNs) {
+    static thread_local LookAgain t_Look;
+    if (IsOver() || t_Look.Look([this] { return IsOver(); })) return;
+    constexpr int64_t kSecond = 1000000000;
+    timespec deadline = {deadlineNs / kSecond, deadlineNs % kSecond};
+    uint32_t awake = kAwake;
+    m_State.compare_exchange_strong(awake, kAsleep);
+    while (!IsOver()) {
+        int error = Platform::FutexWaitSteady(m_State, kAsleep, deadlineNs ? &deadline : nullptr);
+        if (error == ETIMEDOUT) return;
+    }
 }
 
 RequestTable::~RequestTable() {
@@ -52,6 +78,7 @@ bool RequestTable::Add(Request* request) {
     if (m_Count >= m_Size && !Grow() && !m_Size) return false;
     Request*& bucket = m_Buckets[request->m_Context % m_Size];
     request->m_Next = std::exchange(bucket, request);
+    request->m_IsInTable = true;
     m_Count++;
     return true;
 }
@@ -66,6 +93,7 @@ void RequestTable::Remove(Request* request) {
     Request** link = &m_Buckets[request->m_Context % m_Size];
     while (*link != request) link = &(*link)->m_Next;
     *link = request->m_Next;
+    request->m_IsInTable = false;
     m_Count--;
 }
 
@@ -93,14 +121,18 @@ Packet* PacketQueue::Take() {
     return packet;
 }
 
-int64_t LookAgain::GetBudgetNs() {
-    if (m_Credit <= 0 && ++m_Skipped % kTryEach != 0) return 0;
-    return s_PollMicroseconds * int64_t{1000};
+int64_t LookAgain::Begin() {
+    int64_t now = NowNs();
+    bool pays = m_Credit > 0 || ++m_Skipped % kTryEach == 0;
+    m_LimitNs = pays ? now + s_PollMicroseconds * 1000 : now;
+    return now;
 }
 
-void LookAgain::Note(bool found) {
-    if (found && m_Credit < kMostCredit) m_Credit++;
-    if (!found && m_Credit > 0) m_Credit--;
+int64_t LookAgain::GiveWay(int64_t last) {
+    sched_yield();
+    int64_t now = NowNs();
+    if (now - last > kTurnNs) m_LimitNs = now;  // others have work to do
+    return now;
 }
 
 }  // namespace Korvel

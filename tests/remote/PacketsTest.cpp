@@ -28,33 +28,23 @@ using PacketPtr = std::unique_ptr<Packet, decltype(&FreePkt)>;
 
 const std::string kPeerUUID = "aaaaaaaa-bbbb-4ccc-8ddd-eeeeeeeeeeee";
 
-// A connection that can give one object away, as number 7, and counts all objects of the peer.
+// A connection that says it is connected.
 class FakeApp : public RemoteApp {
 public:
     FakeApp() : RemoteApp("fake", 0, nullptr) {}
 
-    RemoteObject* _IncLocalRef(void* object) override {
-        m_Export = {
-            m_Export.m_Count + 1, 7, static_cast<ScriptObject*>(object), this, nullptr, true};
-        return &m_Export;
-    }
-    RemoteObject* FindLocalObject(unsigned long long id) override {
-        if (id != m_Export.m_ID) return nullptr;
-        m_Export.m_Object->IncRef();
-        return &m_Export;
-    }
-    RemoteObject* IncRemoteRef(unsigned long long id) override {
-        if (id == 0) return nullptr;
-        m_Proxy = {m_Proxy.m_Count + 1, static_cast<uint32_t>(id), nullptr, this, nullptr, false};
-        return &m_Proxy;
-    }
-    void DecRemoteRef(unsigned long long) override { m_Proxy.m_Count--; }
     bool Connected() const override { return m_IsConnected; }
     Platform::_Socket* GetSocket() const override { return m_Socket; }
     ScriptVal GetUUID() const override { return kPeerUUID.c_str(); }
     uint32_t SendPkt(Packet* packet) override { return m_Sent.reset(packet), packet->m_Context; }
 
-    RemoteObject m_Export = {}, m_Proxy = {};
+    // Proxies of the small numbers that tests use, and of what cannot be named.
+    int CountProxies() {
+        int count = !FindRemoteObject(UINT_MAX).IsNil();
+        for (int id = 2; id < 100; id++) count += !FindRemoteObject(id).IsNil();
+        return count;
+    }
+
     bool m_IsConnected = true;
     Platform::_Socket* m_Socket = nullptr;
     PacketPtr m_Sent{nullptr, FreePkt};
@@ -217,24 +207,27 @@ TEST(Wire, ObjectsAreCountedAndSwapSides) {
     FakeObject object;
     ScriptVal value(&object), back;
     const std::string ours = GetAppUUID().ToString("");
-    EXPECT_EQ(Write(value, &app), Object(SV_LocalObject, 7, ours));
+    RemoteObject* record = app._IncLocalRef(&object);
+    const uint32_t id = record->m_ID;
+    EXPECT_EQ(Write(value, &app), Object(SV_LocalObject, id, ours));
+    EXPECT_EQ(record->m_Count, 2u);
 
     // It comes home as the object, with a count of the value's own.
-    ASSERT_TRUE(Read(Object(SV_RemoteObject, 7), back, &app));
+    ASSERT_TRUE(Read(Object(SV_RemoteObject, id), back, &app));
     EXPECT_EQ(back.ToLocalObject(), &object);
-    EXPECT_EQ(object.m_Uses, 2);
-    ASSERT_TRUE(Read(Object(SV_RemoteObject, 8), back, &app));  // never given to this peer
+    EXPECT_EQ(object.m_Uses, 3);
+    ASSERT_TRUE(Read(Object(SV_RemoteObject, id), back, &other));  // never given to this peer
     EXPECT_EQ(Describe(back), "0:nil");
-    EXPECT_EQ(object.m_Uses, 1);
+    EXPECT_EQ(object.m_Uses, 2);
 
     // An object of the peer is a proxy here, which has a name on its own connection alone.
     ASSERT_TRUE(Read(Object(SV_LocalObject, 5, std::string(36, 0)), back, &app));
-    EXPECT_EQ(app.m_Proxy.m_Count, 1u);
+    EXPECT_EQ(app.CountProxies(), 1);
     EXPECT_EQ(Write(back, &app), Object(SV_RemoteObject, 5));
     EXPECT_EQ(Write(back, &other), Object(SV_RemoteObject, UINT_MAX));
     ASSERT_TRUE(Read(Object(SV_LocalObject, 0), back, &app));
     EXPECT_EQ(Describe(back), "0:nil");
-    EXPECT_EQ(app.m_Proxy.m_Count, 0u);
+    EXPECT_EQ(app.CountProxies(), 0);
 
     // What cannot be named is not counted: without a connection, borrowed, dead, after the end.
     const std::string unnamed = Object(SV_LocalObject, UINT_MAX, ours);
@@ -248,7 +241,7 @@ TEST(Wire, ObjectsAreCountedAndSwapSides) {
     EXPECT_EQ(Write(stale, &app), unnamed);
     app.m_IsConnected = false;
     EXPECT_EQ(Write(value, &app), unnamed);
-    EXPECT_EQ(app.m_Export.m_Count, 1u);
+    EXPECT_EQ(record->m_Count, 2u);
 
     // Code is marked when it comes from another process.
     const std::string code = Word(SV_Code) + Word(1) + "c";
@@ -258,26 +251,32 @@ TEST(Wire, ObjectsAreCountedAndSwapSides) {
     app.m_Socket = kInProcess;
     ASSERT_TRUE(Read(code, value, &app));
     EXPECT_EQ(Describe(value), "8:[c]");
+
+    // Within the process a proxy leads to the object, as long as the connection is that one.
+    ASSERT_TRUE(Read(Object(SV_LocalObject, id), back, &app));
+    EXPECT_TRUE(back.IsRemoteObject() && back.ToLocalObject() == &object);
+    app.m_Socket = nullptr;
+    EXPECT_EQ(back.ToLocalObject(), nullptr);
 }
 
 // What was counted before a packet proves malformed, or is read by nobody, goes back.
 TEST(Packets, NothingThatIsDroppedStaysCounted) {
     FakeApp app;
     FakeObject object;
-    app._IncLocalRef(&object);
+    const uint32_t id = app._IncLocalRef(&object)->m_ID;
     const std::string values = Object(SV_LocalObject, 5) + Word(SV_Table) + "\0"s + Word(1) +
-                               Object(SV_RemoteObject, 7) + Object(SV_LocalObject, 6);
+                               Object(SV_RemoteObject, id) + Object(SV_LocalObject, 6);
     for (size_t length = 0; length <= values.size() + 1; length++) {
         PacketPtr packet = MakePacket((values + "?").substr(0, length));
         ScriptVal first = "as it was", second = first;
         bool isWhole = length == values.size();
         EXPECT_EQ(ScriptVal::FromPacket(&app, packet.get(), &first, &second), isWhole);
-        EXPECT_EQ(object.m_Uses, isWhole);
+        EXPECT_EQ(object.m_Uses, 1 + isWhole);
         EXPECT_TRUE(isWhole || first == second);
         DropPkt(&app, packet.release());
     }
-    EXPECT_EQ(object.m_Uses, 0);
-    EXPECT_EQ(app.m_Proxy.m_Count, 0u);
+    EXPECT_EQ(object.m_Uses, 1);
+    EXPECT_EQ(app.CountProxies(), 0);
 }
 
 TEST(Packets, Headers) {
@@ -285,11 +284,11 @@ TEST(Packets, Headers) {
     PacketPtr packet(CreatePkt(PKT_NoMoreRefs, &app, nullptr, nullptr), FreePkt);
     EXPECT_EQ(Write(packet), Word(40) + Word(4) + std::string(32, 0));
 
-    RemoteObject proxy = {1, 9, nullptr, &app, nullptr, false};
+    RemoteObject* proxy = app.IncRemoteRef(9);
     ScriptArgs args, read;
     args.SetPosition(0, "Name");
     app.SetFlags(PKF_Trace);
-    packet.reset(ScriptVal::ToPacket(&proxy, SST_GetTable, nullptr, &args));
+    packet.reset(ScriptVal::ToPacket(proxy, SST_GetTable, nullptr, &args));
     app.ClearFlags(PKF_Trace);
     EXPECT_EQ(Write(packet), Word(65) + Word(1) + Word(130) + Word(9) + Word(0) + Word(PKF_Trace) +
                                  Word(0) + Word(0) + Word(0) + Word(SV_Args) + Word(1) + Number(0) +
@@ -297,7 +296,7 @@ TEST(Packets, Headers) {
 
     // A traced call has its mark from the packet, and its own calls keep it.
     read.m_Value.m_Args.m_Context = 77;
-    ASSERT_TRUE(ScriptVal::FromPacket(&proxy, packet.get(), nullptr, &read));
+    ASSERT_TRUE(ScriptVal::FromPacket(proxy, packet.get(), nullptr, &read));
     EXPECT_EQ(read.m_Flags, SV_Args | SVF_FromWire);
     EXPECT_EQ(read.m_Value.m_Args.m_Context, 77u);
     packet.reset(ScriptVal::ToPacket(&app, 1, 1, nullptr, &read));
@@ -319,6 +318,7 @@ TEST(Packets, Headers) {
         EXPECT_EQ(packet != nullptr, spare == 44);
     }
     setLimit("256");
+    proxy->DecRef();
 }
 
 TEST(Packets, RepliesTakeResultsAndErrors) {
@@ -425,9 +425,9 @@ TEST(Packets, MemoryRunsOut) {
             }
         }
         hasFailed = Faults::Stop() >= n;
-        EXPECT_EQ(app.m_Proxy.m_Count, 0u);
+        EXPECT_EQ(app.CountProxies(), 0);
     }
-    EXPECT_EQ(object.m_Uses, 1);
+    EXPECT_EQ(object.m_Uses, 2) << "the arguments' and the connection's";
 }
 #endif
 

@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <cstring>
 #include <functional>
 #include <map>
 #include <memory>
@@ -32,16 +33,17 @@ public:
         return 1;
     }
     void Disconnect() override { m_NumEnds++; }
+    void Start() {
+        InitReferences();
+        HoldRoot();
+    }
     void End() {
         m_IsOpen = false;
-        CleanUpReferences();
+        Cleanup(GetRun());
     }
 
-    using RemoteApp::CleanUpReferences;
     using RemoteApp::DropLocalRefs;
     using RemoteApp::ExportAddress;
-    using RemoteApp::HoldLocalObject;
-    using RemoteApp::HoldRoot;
 
     std::atomic<bool> m_IsOpen{true};
     std::mutex m_SentLock;
@@ -85,6 +87,7 @@ private:
 TEST(References, AnObjectIsHeldOnceForEachConnection) {
     Thing* thing = new Thing;
     TestApp first, second;
+    first.Start();
     uint32_t id = first._IncLocalRef(thing)->m_ID;
     for (int i = 0; i < 2; i++) EXPECT_EQ(first._IncLocalRef(thing)->m_ID, id);
     EXPECT_EQ(first.FindLocalObject(id)->m_Count, 3u);
@@ -134,7 +137,7 @@ TEST(References, TheLastProxySendsOneRelease) {
     RemoteObject lone{};
     lone.IncRef();
     lone.DecRef();
-    app.CleanUpReferences();
+    app.Cleanup(app.GetRun());
     static_cast<Thing*>(Root::s_Object)->DecRef();
     EXPECT_EQ(app.GetUseCount(), 1u);
 }
@@ -144,7 +147,7 @@ TEST(References, NumberOneIsTheApplicationInEachRun) {
     Root root(thing);
     TestApp app, other;
     EXPECT_EQ(app.HoldLocalObject(1), thing) << "before anything has been sent";
-    app.HoldRoot();
+    app.Start();
     EXPECT_EQ(app._IncLocalRef(thing)->m_ID, 1u);
     EXPECT_EQ(thing->m_Count, 4) << "ours, what the search holds, and one for each connection";
     EXPECT_TRUE(app.DropLocalRefs(1));
@@ -156,7 +159,7 @@ TEST(References, NumberOneIsTheApplicationInEachRun) {
     Thing* next = new (place) Thing;
     Root::s_Object = next;
     app.m_IsOpen = true;
-    app.HoldRoot();
+    app.Start();
     EXPECT_EQ(app.HoldLocalObject(1), next);
     EXPECT_EQ(other.HoldLocalObject(1), thing);
     next->~Thing();
@@ -173,7 +176,7 @@ TEST(References, NumberOneIsTheApplicationInEachRun) {
     EXPECT_EQ(next->m_Count, 1);
     next->~Thing();
     app.m_IsOpen = true;
-    app.HoldRoot();
+    app.Start();
     EXPECT_FALSE(app.HoldLocalObject(1));
     EXPECT_TRUE(app.DropLocalRefs(1)) << "an entry without an object";
     other.End();
@@ -185,6 +188,7 @@ TEST(References, NumberOneIsTheApplicationInEachRun) {
 TEST(References, ADeadObjectIsFoundNoMore) {
     alignas(_Object) unsigned char place[sizeof(_Object)];
     TestApp app, other;
+    app.Start();
     auto* object = new (place) _Object;
     uint32_t stale = app._IncLocalRef(object)->m_ID;
     app._IncLocalRef(object);
@@ -195,7 +199,7 @@ TEST(References, ADeadObjectIsFoundNoMore) {
 
     object = new (place) _Object;
     ScriptVal seen(object);
-    uint32_t id = app.ExportAddress(reinterpret_cast<uintptr_t>(place))->m_ID;
+    uint32_t id = app.ExportAddress(reinterpret_cast<uintptr_t>(place));
     EXPECT_GT(id, stale);
     EXPECT_TRUE(app._DecLocalRef(object)) << "the living one comes first";
     EXPECT_FALSE(app.FindLocalObject(id));
@@ -235,6 +239,22 @@ TEST(References, ObjectsAreCountedWithoutLocks) {
     EXPECT_EQ(app.HoldLocalObject(id), thing);
     EXPECT_EQ(numCounted, 2);
     thing->DecRef();
+    EXPECT_TRUE(app.DropLocalRefs(id));
+
+    {  // in packets: it goes out, and comes home as the peer's proxy of it
+        ScriptVal value(thing), proxy;
+        Packet* packet = CreatePkt(PKT_Script, &app, &value, nullptr);
+        memcpy(&id, packet->Payload() + 4, sizeof id);
+        RemoteObject* record = app.IncRemoteRef(id);
+        proxy.Set(SV_RemoteObject, &record);
+        record->DecRef();
+        FreePkt(std::exchange(packet, CreatePkt(PKT_Script, &app, nullptr, &proxy)));
+        numCounted = 0;
+        EXPECT_TRUE(ScriptVal::FromPacket(&app, packet, nullptr, &value));
+        EXPECT_EQ(value.ToLocalObject(), thing);
+        EXPECT_EQ(numCounted, 2) << "one more, and the old one less";
+        FreePkt(packet);
+    }
 
     // The peer lets go, or the connection ends, while the object is being counted for a call.
     for (bool isEnd : {false, true}) {
@@ -292,7 +312,7 @@ TEST(References, TheEndGivesAllBack) {
             if (RemoteObject* proxy = app.IncRemoteRef(n + 1)) proxy->DecRef();
         }
         isDone = Faults::Stop() < n;
-        app.CleanUpReferences();
+        app.Cleanup(app.GetRun());
         EXPECT_TRUE(!isDone || things[99]->m_Count == 2) << "nothing while it is connected";
         app.End();
         EXPECT_FALSE(app._IncLocalRef(things[0])) << "closed";

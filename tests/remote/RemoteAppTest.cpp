@@ -4,129 +4,28 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <cstring>
+#include <chrono>
+#include <climits>
+#include <cstdio>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
 #include <thread>
 #include <vector>
 
-#include "Platform/Event.h"
-#include "Platform/Networking.h"
-#include "Platform/Time.h"
+#include "RemoteFixture.h"
 #include "Support.h"
-#include "core/RefObject.h"
-#include "objects/Publish.h"
-#include "objects/ScriptConfig.h"
-#include "remote/Packets.h"
 
 namespace Korvel {
 namespace {
 
-constexpr unsigned int kLimitMs = 60000;
-
-// An object that is served. It lives as long as somebody counts it.
-class Box : public Scripted<_Object> {
-    KORVEL_SCRIPTED(Box)
-public:
-    Box() {
-        SetScriptClass();
-        s_NumAlive++;
-    }
-    ~Box() override { s_NumAlive--; }
-    void IncRef() override { m_Count++; }
-    void DecRef() override {
-        if (--m_Count == 0) delete this;
-    }
-
-    static inline std::atomic<int> s_NumAlive{0};
-    static inline KorvelScript::Event s_Entered;
-    static inline KorvelScript::Event s_Gate;
-    static inline ScriptArgs* s_Deferred = nullptr;
-
-private:
-    std::atomic<int> m_Count{1};
-};
-
-KORVEL_PUBLISH(Box, "Box", "Answers.", "")
-KORVEL_OPCODE(Box, SST_Call, SSF_AnyThread) {
-    args.Return(args[1]);
-}
-KORVEL_OPCODE(Box, SST_Add, SSF_AnyThread) {
-    Box* made = new Box;
-    args.ReturnObject(made);
-    made->DecRef();
-}
-KORVEL_OPCODE(Box, SST_Sub, SSF_AnyThread) {
-    Box::s_Entered.Signal();
-    Box::s_Gate.Wait(kLimitMs);
-    args.ReturnNumber(1);
-}
-KORVEL_OPCODE(Box, SST_Concat, SSF_AnyThread) {
-    Box::s_Deferred = args.DeferReply();
-    Box::s_Entered.Signal();
-}
-KORVEL_OPCODE(Box, SST_Div, SSF_AnyThread) {
-    args.SetError(SCERR_InvalidArgs, "told");
-}
-KORVEL_PUBLISHED(Box);
-
-constexpr unsigned int kLoopback = 0x0100007F;  // 127.0.0.1 in network order
-
-// Listens on a port of the system's choice.
-class Listener {
-public:
-    Listener() {
-        using namespace Platform;
-        EXPECT_TRUE(BindSocket(m_Socket, 0, kLoopback) && ListenSocket(m_Socket, 0));
-        _SocketAddress* address = GetSocketAddress(m_Socket);
-        m_Port = SocketAddressGetPort(address);
-        DeleteSocketAddress(address);
-    }
-    ~Listener() { Platform::DeleteSocket(m_Socket); }
-    Platform::_Socket* Accept() { return Platform::AcceptSocket(m_Socket); }
-
-    Platform::_Socket* const m_Socket = Platform::NewSocket(Platform::ST_TCP);
-    unsigned int m_Port;
-};
-
-// The two ends of a TCP connection of this machine.
-struct Ends {
-    Ends() {
-        Listener listener;
-        m_Near = Platform::NewSocket(Platform::ST_TCP);
-        EXPECT_TRUE(Platform::ConnectSocket(m_Near, listener.m_Port, kLoopback));
-        m_Far = listener.Accept();
-    }
-    Platform::_Socket* m_Near;
-    Platform::_Socket* m_Far;
-};
+using namespace Test;
 
 class RemoteAppTest : public testing::TestWithParam<bool> {
 protected:
     RemoteAppTest() {
-        s_Root = new Box;
-        m_Config.GetApp = [](void*, TagList*) -> ScriptObject* { return s_Root; };
-        g_ScriptConfig = &m_Config;
-        m_Near = new RemoteApp("near", 0, nullptr);
-        m_Far = new RemoteApp("far", 0, nullptr);
-        if (GetParam()) {
-            EXPECT_TRUE(RemoteApp::Join(m_Near, m_Far));
-        } else {
-            Ends ends;
-            EXPECT_TRUE(m_Near->Connect(ends.m_Near) && m_Far->Connect(ends.m_Far));
-        }
-        m_Near->SetTimeOut(60);
+        m_Near->SetTimeOut(kLimitMs / 1000);
         m_Proxy = m_Near->FindRemoteObject(1);
-    }
-    ~RemoteAppTest() override {
-        m_Proxy = SV_Nil;
-        for (RemoteApp* app : {m_Near, m_Far}) app->_Disconnect(0xffffffff);
-        for (RemoteApp* app : {m_Near, m_Far}) {
-            while (app->Connected()) std::this_thread::yield();
-            app->Recycle();
-        }
-        s_Root->DecRef();
-        for (int i = 0; Box::s_NumAlive && i < 5000; i++) Platform::Wait(1);
-        EXPECT_EQ(Box::s_NumAlive, 0);
-        g_ScriptConfig = nullptr;
     }
 
     ScriptVal Call(int op, const ScriptVal& value) {
@@ -137,10 +36,10 @@ protected:
         return result;
     }
 
-    static inline Box* s_Root;
-    ScriptConfig m_Config;
-    RemoteApp* m_Near;
-    RemoteApp* m_Far;
+    BoxHost m_Host;
+    Link m_Link{GetParam()};
+    RemoteApp* const m_Near = m_Link.m_Near;
+    RemoteApp* const m_Far = m_Link.m_Far;
     ScriptVal m_Proxy;
     bool m_HasReply = false;
 };
@@ -271,9 +170,224 @@ TEST_P(RemoteAppTest, CountsTheObjectsThatCross) {
     }
 }
 
+TEST_P(RemoteAppTest, AsyncRepliesComeAsPackets) {
+    struct Answer {
+        ScriptVal m_Result;
+        KorvelScript::Event m_HasCome;
+    } answer;
+    auto take = [](void* data, RemoteApp* app, Packet* reply, unsigned int) {
+        auto* to = static_cast<Answer*>(data);
+        EXPECT_TRUE(reply && ScriptVal::FromPacket(app, reply, nullptr, &to->m_Result));
+        FreePkt(reply);
+        to->m_HasCome.Signal();
+        return true;
+    };
+    ScriptArgs args;
+    args.SetArguments("text");
+    RemoteObject* root = m_Proxy.ToRemoteObject();
+    EXPECT_NE(root->DoCommandAsync(SST_Call, args, take, &answer), 0u);
+    ASSERT_TRUE(answer.m_HasCome.Wait(kLimitMs));
+    EXPECT_TRUE(answer.m_Result[-1] == "text");
+    EXPECT_NE(root->DoCommandAsync(SST_Call, args, nullptr, nullptr), 0u);
+
+    // A reply that the callback leaves stays for whoever asks, without a wait.
+    Setting noLook("KORVEL_PollMicroseconds", "0", "50");
+    auto leave = [](void* data, RemoteApp*, Packet*, unsigned int) {
+        static_cast<Answer*>(data)->m_HasCome.Signal();
+        return false;
+    };
+    uint32_t context = root->DoCommandAsync(SST_Call, args, leave, &answer);
+    ASSERT_TRUE(answer.m_HasCome.Wait(kLimitMs));
+    Packet* reply = nullptr;
+    EXPECT_TRUE(WaitUntil([&] { return (reply = m_Near->PollPkt(context)) != nullptr; }));
+    FreePkt(reply);
+    EXPECT_EQ(m_Near->PollPkt(context), nullptr);
+}
+
+// The callback hears of its request once, whatever becomes of the reply that it has left.
+TEST_P(RemoteAppTest, AReplyThatWasLeftIsNotToldAgain) {
+    struct Told {
+        std::atomic<int> m_NumReplies{0};
+        std::atomic<int> m_NumEnds{0};
+    } told;
+    auto leave = [](void* data, RemoteApp*, Packet* reply, unsigned int) {
+        auto* to = static_cast<Told*>(data);
+        (reply ? to->m_NumReplies : to->m_NumEnds)++;
+        return false;
+    };
+    ScriptArgs args;
+    RemoteObject* root = m_Proxy.ToRemoteObject();
+    uint32_t context = 0;
+    int numLate = 0;
+    for (double seconds = 0.05; told.m_NumReplies == 0; seconds *= 2) {
+        m_Near->SetTimeOut(seconds);
+        context = root->DoCommandAsync(SST_Call, args, leave, &told);
+        EXPECT_TRUE(WaitUntil([&] { return told.m_NumReplies || told.m_NumEnds > numLate; }));
+        numLate = told.m_NumEnds;
+    }
+    // Its time has passed when that of a later one has.
+    EXPECT_NE(root->DoCommandAsync(SST_Concat, args, leave, &told), 0u);
+    EXPECT_TRUE(WaitUntil([&] { return told.m_NumEnds > numLate; }));
+    ASSERT_TRUE(Box::s_Entered.Wait(kLimitMs));
+    delete Box::s_Deferred;
+    Packet* reply = m_Near->PollPkt(context);
+    EXPECT_NE(reply, nullptr);
+    FreePkt(reply);
+    EXPECT_EQ(m_Near->PollPkt(context), nullptr);
+
+    m_Near->SetTimeOut(kLimitMs / 1000);
+    EXPECT_NE(root->DoCommandAsync(SST_Call, args, leave, &told), 0u);
+    EXPECT_TRUE(WaitUntil([&] { return told.m_NumReplies == 2; }));
+    m_Link.End();
+    EXPECT_EQ(told.m_NumReplies, 2);
+    EXPECT_EQ(told.m_NumEnds, numLate + 1);
+}
+
+TEST_P(RemoteAppTest, DelaysKeepTheOrder) {
+    using Clock = std::chrono::steady_clock;
+    auto start = Clock::now();
+    std::vector<uint32_t> contexts;
+    for (unsigned delayMs : {0, 60, 0, 60}) {
+        Packet* packet = CreatePkt(PKT_IncRef, m_Near, nullptr, nullptr);
+        packet->m_Delay = delayMs;
+        contexts.push_back(m_Near->SendPkt(packet));
+    }
+    for (size_t i : {3u, 2u, 1u, 0u}) {
+        Packet* reply = m_Near->WaitPkt(contexts[i], i == 3 ? kLimitMs / 1000 : -1);
+        EXPECT_NE(reply, nullptr) << "the last one is answered last";
+        FreePkt(reply);
+    }
+    EXPECT_GE(Clock::now() - start, std::chrono::milliseconds(120));
+}
+
+// Only members set the keys that make an error, or a delay, of a reply.
+TEST_P(RemoteAppTest, ReservedKeysOfArgumentsAreTakenOut) {
+    ScriptArgs args;
+    args.SetArguments("text");
+    args["Error"] = 9;
+    args["ErrorString"] = "from the caller";
+    args["__delay"] = 1e9;
+    ScriptVal result;
+    EXPECT_TRUE(m_Proxy.ToRemoteObject()->DoCommand(SST_Call, args, result));
+    EXPECT_TRUE(result[-1] == "text");
+    EXPECT_TRUE(result["Error"].IsNil() && result["ErrorString"].IsNil());
+}
+
+TEST_P(RemoteAppTest, TellsWhereAnObjectIs) {
+    EXPECT_TRUE(Call(SST_ToString, 0)[-1] == "a box [App: 'near' on 0.0.0.0, UUID: <nil>]");
+}
+
+TEST_P(RemoteAppTest, NumbersObjectsByAddress) {
+    Box* box = new Box;
+    ScriptVal value(box);  // from now on scripts have seen it
+    uint64_t address = reinterpret_cast<uintptr_t>(box);
+    RemoteObject* proxy = m_Near->LocalToRemote(address);
+    ASSERT_NE(proxy, nullptr);
+    {
+        ScriptArgs args;
+        ScriptVal result;
+        EXPECT_TRUE(proxy->DoCommand(SST_ToString, args, result));
+        EXPECT_TRUE(result["Error"].IsNil());
+    }
+    EXPECT_EQ(m_Near->LocalToRemote(address), proxy);
+    for (int i = 0; i < 2; i++) proxy->DecRef();
+    value = SV_Nil;
+    box->DecRef();
+    EXPECT_TRUE(WaitUntil([] { return Box::s_NumAlive == 1; }));
+    for (uint64_t hostile :
+         {address, uint64_t{0}, uint64_t{1}, ~uint64_t{0}, reinterpret_cast<uint64_t>(m_Far)}) {
+        EXPECT_EQ(m_Near->LocalToRemote(hostile), nullptr) << hostile;
+    }
+}
+
+TEST_P(RemoteAppTest, ItsOwnThreadDoesNotWait) {
+    EXPECT_TRUE(Call(SST_Pow, 0)[-1] == false);
+}
+
+TEST_P(RemoteAppTest, TracesWhatACallCauses) {
+    testing::internal::CaptureStdout();
+    m_Near->SetFlags(PKF_Trace);
+    Call(SST_Call, "text");
+    m_Near->ClearFlags(PKF_Trace);
+    Call(SST_Call, "more");
+    std::string out = testing::internal::GetCapturedStdout();
+    char expected[1000];
+    snprintf(expected, sizeof expected,
+             "App %p: Send ctx=1 tgt=1 PKT_Script SST_Call \n"
+             "App %p: Recv ctx=1 tgt=1 PKT_Script SST_Call \n"
+             "   -> [1] Table\n{\n  1 = \"text\"\n}\n"
+             "   <- [1] Table\n{\n  -1 = \"text\"\n}\n"
+             "App %p: Send ctx=1 tgt=0 PKT_Reply \n"
+             "App %p: Recv ctx=1 tgt=0 PKT_Reply \n",
+             static_cast<void*>(m_Near), static_cast<void*>(m_Far), static_cast<void*>(m_Far),
+             static_cast<void*>(m_Near));
+    EXPECT_EQ(out, expected);
+}
+
+TEST_P(RemoteAppTest, ConnectsAgain) {
+    ScriptVal made = Call(SST_Add, 0)[-1];
+    ASSERT_TRUE(made.IsRemoteObject());
+    for (int i = 0; i < 20; i++) {
+        bool isOurs = i % 2 == 0;
+        (isOurs ? m_Near : m_Far)->_Disconnect(i % 4 < 2 ? kLimitMs : 0);
+        while (m_Near->Connected() || m_Far->Connected()) std::this_thread::yield();
+        ScriptArgs args;
+        ScriptVal result;
+        EXPECT_FALSE(made.ToRemoteObject()->DoCommand(SST_Call, args, result));
+        m_Proxy = SV_Nil;
+        ASSERT_TRUE(m_Link.Connect());
+        m_Proxy = m_Near->FindRemoteObject(1);
+        ASSERT_TRUE(m_Proxy.IsRemoteObject()) << "the way in, from the beginning";
+        EXPECT_TRUE(Call(SST_Call, i)[-1] == i);
+        EXPECT_TRUE(made.ToRemoteObject()->DoCommand(SST_Call, args, result));
+        EXPECT_TRUE(result["Error"] == 10) << "given on a connection that has ended";
+    }
+}
+
+// The peer lets go of it as soon as it has answered, which must not overtake the answer.
+TEST_P(RemoteAppTest, AnObjectComesHomeFromAPeerThatKeepsNothing) {
+    for (int i = 0; i < 200; i++) {
+        Box* box = new Box;
+        ScriptVal own(box);
+        box->DecRef();
+        ASSERT_TRUE(Call(SST_Call, own)[-1] == own) << i;
+    }
+}
+
 INSTANTIATE_TEST_SUITE_P(Forms, RemoteAppTest, testing::Bool(), [](const auto& form) {
     return std::string(form.param ? "InProcess" : "Socket");
 });
+
+// The thread of either connection of a pair brings what the other one waits for.
+TEST(RemoteAppPair, TheOtherOnesThreadDoesNotWait) {
+    BoxHost host;
+    Link link(true);
+    Box::s_Through = link.m_Near;
+    link.m_Near->SetTimeOut(0);
+    ScriptArgs args;
+    ScriptVal result, root = link.m_Near->FindRemoteObject(1);
+    EXPECT_TRUE(root.ToRemoteObject()->DoCommand(SST_Pow, args, result));
+    EXPECT_TRUE(result[-1] == false);
+    Box::s_Through = nullptr;
+}
+
+// The last peer comes to its end when the next one is there already.
+TEST(RemoteAppPair, IsJoinedAnewAtOnce) {
+    BoxHost host;
+    ptr<RemoteApp> last(new RemoteApp("last", 0, nullptr)), next(new RemoteApp("next", 0, nullptr));
+    ptr<RemoteApp> app(new RemoteApp("app", 0, nullptr));
+    app->SetTimeOut(kLimitMs / 1000);
+    for (int i = 0; i < 100; i++) {
+        ASSERT_TRUE(RemoteApp::Join(last.Get(), app.Get()));
+        EXPECT_TRUE(app->_Disconnect(kLimitMs));
+        ASSERT_TRUE(RemoteApp::Join(app.Get(), next.Get()));
+        EXPECT_TRUE(WaitUntil([&] { return last->GetUseCount() == 1; }));
+        ScriptArgs args;
+        ScriptVal result, root = app->FindRemoteObject(1);
+        EXPECT_TRUE(root.ToRemoteObject()->DoCommand(SST_Call, args, result)) << i;
+        for (RemoteApp* end : {app.Get(), next.Get()}) end->_Disconnect(kLimitMs);
+    }
+}
 
 // What a peer sends that is no packet ends its connection, and nothing else.
 TEST(RemoteAppPeer, IsClosedForWhatIsNoPacket) {
@@ -287,45 +401,146 @@ TEST(RemoteAppPeer, IsClosedForWhatIsNoPacket) {
                           {0xffffffff, PKT_Script, 0},
                           {40, PKT_SetStateData, SV_Number},
                           {40, PKT_GetObjectInfo, 99}};
-    ScriptConfig config;
-    g_ScriptConfig = &config;
-    testing::internal::CaptureStderr();
+    BoxHost host;
+    Bare other;
     for (const Case& c : cases) {
-        Ends ends;
-        auto* app = new RemoteApp("victim", 0, ends.m_Far);
+        Bare peer;
         uint32_t packet[10] = {c.m_Size, c.m_Type, 1, 1, 1, 0, 0, 0, 0, c.m_First};
-        EXPECT_EQ(Platform::SocketSend(ends.m_Near, packet, sizeof(packet)), 40);
-        char byte;
-        EXPECT_EQ(Platform::SocketReceive(ends.m_Near, &byte, 1, nullptr, nullptr), 0);
-        Platform::DeleteSocket(ends.m_Near);
-        while (app->Connected()) std::this_thread::yield();
-        app->Recycle();
+        peer.Send(packet, sizeof packet);
+        EXPECT_EQ(peer.Receive(), nullptr);
+        EXPECT_TRUE(WaitUntil([&] { return !peer.m_App->Connected(); }));
     }
-    EXPECT_NE(testing::internal::GetCapturedStderr(), "");
-    g_ScriptConfig = nullptr;
+    EXPECT_TRUE(other.Ask(PKT_GetObjectInfo, 0, 1, 5)[1] == 5);
+}
+
+// In a process of its own, whose log goes to a folder of the test's own.
+TEST(RemoteAppPeer, TellsTheLogWhyItIsClosed) {
+    TempDir dir;
+    std::string self = std::filesystem::read_symlink("/proc/self/exe");
+    std::string command = "cd '" + dir.Path(".") + "' && exec '" + self +
+                          "' --gtest_filter=RemoteAppPeer.IsClosedForWhatIsNoPacket";
+    EXPECT_EQ(RunProcess({"sh", "-c", command}, {"OXSCRIPT_LOG_SERVER=true"}).m_Status, 0);
+    std::string log;
+    for (const auto& entry : std::filesystem::directory_iterator(dir.Path("."))) {
+        std::ifstream file(entry.path());
+        log.append(std::istreambuf_iterator<char>(file), {});
+    }
+    for (const char* why : {"of an impossible size", "with no valid values"}) {
+        std::string line = "Connection to served closed: the peer sent a packet ";
+        EXPECT_NE(log.find(line + why + ".\n"), std::string::npos) << log;
+    }
+}
+
+// Only an opcode is a symbol: not a number above them, and none whose low bits are one's.
+TEST(RemoteAppPeer, HasNoOtherSymbolsThanOpcodes) {
+    BoxHost host;
+    Bare peer;
+    ScriptArgs args;
+    for (uint32_t symbol :
+         {154u, 155u, 255u, 0x100u | SST_Call, 0x182u, 0x18Fu, 0x80000000u | SST_Call, UINT_MAX}) {
+        EXPECT_TRUE(peer.Ask(PKT_Script, symbol, 1, args)["Error"] == 9) << symbol;
+    }
+}
+
+TEST(RemoteAppPeer, NumbersItsRequestsAsItLikes) {
+    BoxHost host;
+    Bare peer;
+    for (uint32_t context : {0u, 7u, 7u, UINT_MAX}) {
+        for (int op : {SST_Call, SST_Concat}) {
+            if (op == SST_Concat && context == 0) continue;  // those are answered at once
+            ScriptArgs args;
+            args.SetArguments("text");
+            Packet* packet = ScriptVal::ToPacket(nullptr, 1, op, nullptr, &args);
+            packet->m_Context = context;
+            peer.Send(packet);
+            if (op == SST_Concat) {
+                ASSERT_TRUE(Box::s_Entered.Wait(kLimitMs));
+                ASSERT_NE(Box::s_Deferred, nullptr);
+                Box::s_Deferred->ReturnString("text");
+                EXPECT_TRUE(Box::s_Deferred->SendReply());
+                delete Box::s_Deferred;
+            }
+            Packet* reply = peer.Receive();
+            ASSERT_NE(reply, nullptr);
+            EXPECT_TRUE(reply->m_Type == PKT_Reply && reply->m_Context == context);
+            ScriptVal result;
+            EXPECT_TRUE(ScriptVal::FromPacket(peer.m_App, reply, nullptr, &result));
+            EXPECT_TRUE(result[-1] == "text");
+            FreePkt(reply);
+        }
+    }
+}
+
+// Two peers may give the same number to objects of theirs.
+TEST(RemoteAppPeer, WhatTheLastOneGaveLeadsToNobody) {
+    BoxHost host;
+    Bare peer;
+    RemoteObject* old = peer.m_App->IncRemoteRef(7);
+    peer.Reconnect();
+    RemoteObject* fresh = peer.m_App->IncRemoteRef(7);
+    auto expectNext = [&](uint32_t type, uint32_t target) {
+        Packet* packet = peer.Receive();
+        ASSERT_NE(packet, nullptr);
+        EXPECT_TRUE(packet->m_Type == type && packet->m_Target == target) << packet->m_Target;
+        FreePkt(packet);
+    };
+    for (RemoteObject* proxy : {old, fresh}) {
+        ScriptArgs args;
+        EXPECT_NE(proxy->DoCommandAsync(SST_Call, args, nullptr, nullptr), 0u);
+        expectNext(PKT_Script, proxy == old ? UINT_MAX : 7);
+    }
+    old->DecRef();
+    fresh->DecRef();
+    expectNext(PKT_NoMoreRefs, 7);
+}
+
+// What this library serves, but does not ask for.
+TEST(RemoteAppPeer, CountsAndTellsOnRequest) {
+    BoxHost host;
+    Bare peer;
+    ScriptArgs args;
+    ScriptVal made = peer.Ask(PKT_Script, SST_Add, 1, args)[-1];
+    EXPECT_TRUE(made.IsNil()) << "nobody is there to count it";
+    uint32_t id = 2;
+    while (!RemoteApp::GetObjectPtr(id)) id++;
+    EXPECT_TRUE(peer.Ask(PKT_GetObjectInfo, 0, id, "query")[1] == "query");
+    EXPECT_TRUE(peer.Ask(PKT_GetObjectInfo, 0, id + 1).IsNil());
+    for (uint32_t type : {PKT_IncRef, PKT_DecRef, PKT_DecRef}) {
+        EXPECT_EQ(Box::s_NumAlive, 2);
+        EXPECT_TRUE(peer.Ask(type, 0, id).IsNil());
+    }
+    EXPECT_TRUE(WaitUntil([] { return Box::s_NumAlive == 1; }));
+    EXPECT_TRUE(peer.Ask(PKT_Script, SST_Call, id, args)["Error"] == 10);
+    EXPECT_TRUE(peer.Ask(PKT_SetStateData, 0, 0, 5).IsNil());
+    EXPECT_TRUE(peer.Ask(PKT_Script, 0, 1, args)["Error"] == 1);
+    EXPECT_TRUE(peer.Ask(PKT_ScriptEvent, 0, 1)["Error"] == 5);
 }
 
 // A peer that was written after the description of the protocol, in another process.
 TEST(RemoteAppPeer, ServesAnIndependentPeer) {
-    static Box* root;
-    root = new Box;
-    ScriptConfig config;
-    config.GetApp = [](void*, TagList*) -> ScriptObject* { return root; };
-    g_ScriptConfig = &config;
+    BoxHost host;
     Listener listener;
     RemoteApp* app = nullptr;
-    std::thread accept([&] { app = new RemoteApp("peer", 0, listener.Accept()); });
-    Korvel::Test::ProcessResult result = Korvel::Test::RunProcess(
-        {"/usr/bin/python3", PEER_SCRIPT, std::to_string(listener.m_Port)});
+    std::thread accept([&] {
+        app = new RemoteApp("peer", 0, listener.Accept());
+        app->SetTimeOut(kLimitMs / 1000);
+        Box* box = new Box;
+        ScriptVal own(box), result, root = app->FindRemoteObject(1);
+        box->DecRef();
+        uint64_t address = reinterpret_cast<uintptr_t>(box);
+        ScriptArgs args;
+        args.SetArguments(own, static_cast<uint32_t>(address), address >> 32);
+        EXPECT_TRUE(root.ToRemoteObject()->DoCommand(SST_Call, args, result));
+        EXPECT_TRUE(result[-1] == own);
+        EXPECT_TRUE(result[-2].IsRemoteObject());
+    });
+    ProcessResult result =
+        RunProcess({"/usr/bin/python3", PEER_SCRIPT, std::to_string(listener.m_Port)});
     accept.join();
     EXPECT_EQ(result.m_Out + result.m_Err, "ok\n");
-    while (app->Connected()) std::this_thread::yield();
-    app->_Disconnect(0xffffffff);
+    EXPECT_TRUE(WaitUntil([&] { return !app->Connected(); }));
+    app->_Disconnect(kLimitMs);
     app->Recycle();
-    root->DecRef();
-    for (int i = 0; Box::s_NumAlive && i < 5000; i++) Platform::Wait(1);
-    EXPECT_EQ(Box::s_NumAlive, 0);
-    g_ScriptConfig = nullptr;
 }
 
 }  // namespace
