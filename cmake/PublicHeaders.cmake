@@ -44,6 +44,7 @@ set(KORVEL_PUBLIC_HEADERS
     runtime/ScriptLanguage.h
     runtime/lua/KRScriptLib.h
     runtime/lua/LuaLanguage.h
+    runtime/lua/LuaObject.h
     runtime/lua/LuaType.h
     runtime/lua/LuaValues.h
     runtime/lua/RunScript.h

@@ -4,34 +4,25 @@
 
 #include <cmath>
 #include <cstdlib>
+#include <cstring>
 #include <lua.hpp>
 #include <stdexcept>
 #include <string>
 #include <vector>
 
 #include "core/FaultsInternal.h"
+#include "diag/Env.h"
 #include "objects/ScriptConfig.h"
+#include "runtime/lua/KRScriptLibInternal.h"
 
 namespace Korvel {
 namespace {
 
-// The conventions of ordered tables, and what the scripts of the tests use.
+// What the scripts of the tests use.
 const char* const kPrelude = R"lua(
-    _orderedtable_meta = {__newindex = function(t, k, v)
-        rawset(t, k, v)
-        if not t.__keytoidx[k] then
-            t.__idxtokey[#t.__idxtokey + 1] = k
-            t.__keytoidx[k] = #t.__idxtokey
-        end
-    end}
-    function _orderedtable_next(t, key)
-        local position = key == nil and 0 or t.__keytoidx[key]
-        local k = position and t.__idxtokey[position + 1]
-        return k, k ~= nil and t[k] or nil
-    end
-    function table.ordered(keys)
-        local t = setmetatable({__idxtokey = {}, __keytoidx = {}}, _orderedtable_meta)
-        for i, key in ipairs(keys or {}) do t[key] = i end
+    function ordered(keys)
+        local t = table.ordered()
+        for i, key in ipairs(keys) do t[key] = i end
         return t
     end
     function bytes(block)
@@ -68,6 +59,19 @@ int Convert(lua_State* L) {
     return isPushed;
 }
 
+// send(value): to another process and back.
+int Send(lua_State* L) {
+    ScriptVal value, received;
+    EXPECT_TRUE(FromLua(L, 1, value, nullptr, nullptr, 0));
+    std::vector<unsigned char> bytes(value.CalcPktSize());
+    unsigned char* cursor = bytes.data();
+    EXPECT_TRUE(value.ToPkt(nullptr, cursor));
+    cursor = bytes.data();
+    EXPECT_TRUE(received.FromPkt(nullptr, cursor, bytes.data() + bytes.size()));
+    EXPECT_TRUE(received == value);
+    return ToLua(nullptr, L, received, nullptr, nullptr, 0);
+}
+
 // The keys of a value in their order, and "!" behind them if it is ordered.
 int Keys(lua_State* L) {
     ScriptVal value;
@@ -89,7 +93,9 @@ protected:
         luaL_openlibs(m_Lua);
         register_memblock(m_Lua);
         lua_register(m_Lua, "convert", Convert);
+        lua_register(m_Lua, "send", Send);
         lua_register(m_Lua, "keys", Keys);
+        RunOrderedTableScript(m_Lua);
         EXPECT_EQ(Run(kPrelude), "");
     }
     ~LuaValuesTest() override { lua_close(m_Lua); }
@@ -140,6 +146,8 @@ TEST_F(LuaValuesTest, WhatComesBack) {
         {"return convert{__ctor='Point'}.__ctor", "Point"},
         {"return convert{__ctor='\\255'}", kUnsupported},
         {"return convert{__ctor='a\\0'}", kUnsupported},
+        {"c = {__ctor=('x'):rep(1e6)} t = {} for i = 1, 300 do t[i] = c end return convert(t)",
+         "error: Table nested too deeply."},
         {"return convert{__flags=0x500304}.__flags == 0x500100", "true"},
         {"return same(convert{__flags=0x100200, {7}}, {{7}})", "true"},
         {"return same(convert{__flags=0/0}, convert{__flags=-1e300})", "true"},
@@ -149,14 +157,30 @@ TEST_F(LuaValuesTest, WhatComesBack) {
 
 TEST_F(LuaValuesTest, OrderedTables) {
     const Case cases[] = {
-        {"return keys(table.ordered{'b', 2, 'a', 1})", "1 2 b a !"},
-        {"return keys(convert({table.ordered{'b', 'a'}}, true)[1])", "b a !"},
-        {"t = table.ordered{'a', 1} convert(t, true) return rawget(t, 'a') == nil and keys(t)",
-         "!"},
-        {"t = table.ordered{'z'} t.__ctor = 'P' return keys(t) .. convert(t).__ctor", "z !P"},
-        {"t = table.ordered{'z'} t.__flags = 256 return keys(t)", "z "},
+        {"return keys(ordered{'b', 2, 'a', 1})", "1 2 b a !"},
+        {"return keys(convert({ordered{'b', 'a'}}, true)[1])", "b a !"},
+        {"t = ordered{'a', 1} convert(t, true) return rawget(t, 'a') == nil and keys(t)", "!"},
+        {"t = ordered{'z'} t.__ctor = 'P' return keys(t) .. convert(t).__ctor", "z !P"},
+        {"t = ordered{'z'} t.__flags = 256 return keys(t)", "z "},
+        // Entries under the names of its fields do no harm to its order.
+        {"t = convert{__flags=0x200000, __keytoidx=5, __idxtokey={'x'}, x=1}"
+         " return keys(t) .. type(t.__keytoidx)",
+         "x !table"},
+        // An iterator that takes a key out from under the walk over a table further out.
+        {R"(outer = {}
+            for i = 1, 100 do outer['a' .. i] = ordered{'x'} end
+            local step = _orderedtable_next
+            _orderedtable_next = function(t, k)
+                for key in pairs(outer) do outer[key] = nil end
+                for i = 1, 1000 do outer[i] = i end
+                return step(t, k)
+            end
+            local isDone, message = pcall(convert, outer)
+            _orderedtable_next = step
+            return isDone and type(message) or message)",
+         "table"},
         // Nothing to make one, what fails, and what makes no table: plain ones with their flag.
-        {R"(t = table.ordered{'a'}
+        {R"(t = ordered{'a'}
             for _, f in ipairs{false, error, type, function() return 1 end} do
                 table.ordered = f
                 local plain = convert(t)
@@ -175,6 +199,22 @@ TEST_F(LuaValuesTest, OrderedTables) {
          "!"},
     };
     Check(cases);
+}
+
+// Keys that make no entries use up the limit too, or such a walk would go on for ever.
+TEST_F(LuaValuesTest, EndlessOrder) {
+    auto setLimit = [](const char* mib) {
+        setenv("KORVEL_MaxPacketSize", mib, 1);
+        EnvVar::InvalidateEnv();
+    };
+    setLimit("1");
+    for (std::string name : {"__flags", "__ctor", "x"}) {
+        Run("name = '" + name + "'");
+        EXPECT_EQ(Run("t = table.ordered() t.__idxtokey = {name} t.__keytoidx = {[name] = 0}"
+                      " rawset(t, name, 0) return convert(t)"),
+                  "error: Table nested too deeply.");
+    }
+    setLimit("256");
 }
 
 // What a conversion may not change comes back, and what it takes from a table is gone from there.
@@ -205,6 +245,7 @@ TEST_F(LuaValuesTest, RandomTables) {
             local v = {value(0), x = value(0)}
             local copy = convert(v)
             if not same(v, copy) then return "another" end
+            if not same(v, send(v)) then return "another when sent" end
             if not same(convert(v, true), copy) then return "another when consumed" end
             if next(v) ~= nil then return "not consumed" end
         end
@@ -217,12 +258,10 @@ TEST_F(LuaValuesTest, ValuesThatLuaCannotHold) {
     uint64_t word = 1;
     ScriptVal table;
     table = SV_Table;
-    for (ScriptValType type : {SV_Function, SV_Pointer}) {
-        ScriptVal value(type, &word);
-        EXPECT_FALSE(lua_pushscriptval(m_Lua, value));
-        table[value] = 1;
-        table["pointer"] = value;
-    }
+    ScriptVal pointer(SV_Pointer, &word);
+    EXPECT_FALSE(lua_pushscriptval(m_Lua, pointer));
+    table[pointer] = 1;
+    table["pointer"] = pointer;
     table[ScriptVal()] = 2;
     table[NAN] = 3;
     table["nil"] = SV_Nil;
@@ -269,6 +308,36 @@ TEST_F(LuaValuesTest, Results) {
     EXPECT_EQ(ToLuaRet(nullptr, m_Lua, many[-255], nullptr, nullptr, 0), 0);
 }
 
+TEST_F(LuaValuesTest, Code) {
+    OxID error;
+    EXPECT_EQ(lua_StrToCode("return return", error, nullptr), nullptr);
+    EXPECT_NE(strstr(error, "unexpected symbol near 'return'"), nullptr);
+    EXPECT_EQ(lua_FileToCode("/no/such/file.lua", error, nullptr), nullptr);
+    EXPECT_NE(strstr(error, "cannot open"), nullptr);
+    MemBlock* block = lua_StrToCode("return 'one', 2, nil", error, nullptr);
+    ASSERT_NE(block, nullptr);
+    ScriptVal code(block->m_Ptr, block->m_Size, 0);
+    g_ReusePoolMgr.Free(block->m_Ptr);
+    g_ReusePoolMgr.Free(block);
+
+    // All results at the top, exactly one of those inside, none for what fails.
+    EXPECT_TRUE(lua_pushscriptval(m_Lua, code));
+    EXPECT_EQ(lua_gettop(m_Lua), 3);
+    ScriptArgs args;
+    args[-1] = code;
+    args[-2] = ScriptVal("error({})", 9, 0);
+    args[-3] = ScriptVal("return nothing, 4", 17, 0);
+    args[-4] = ScriptVal("=", 1, 0);
+    EXPECT_EQ(Run("function _ALERT(text) told = (told or '') .. (type(text) == 'string' and text "
+                  "or type(text)) .. ';' end"),
+              "");
+    EXPECT_EQ(ToLuaRet(nullptr, m_Lua, args, nullptr, nullptr, 0), 4);
+    EXPECT_EQ(lua_gettop(m_Lua), 4);
+    EXPECT_STREQ(lua_tostring(m_Lua, 1), "one");
+    for (int i = 2; i <= 4; i++) EXPECT_TRUE(lua_isnil(m_Lua, i));
+    EXPECT_EQ(Run("return told"), "table;[string \"<code>\"]:1: unexpected symbol near '=';");
+}
+
 // The callbacks make "UP" of "up" in keys and values, and leave rubbish on the stack.
 TEST_F(LuaValuesTest, Callbacks) {
     auto write = [](RemoteApp*, lua_State* L, ScriptVal& value, void*, auto...) {
@@ -309,10 +378,11 @@ TEST_F(LuaValuesTest, BlocksOfBytes) {
         {"return b.Size .. tostring(b.size) .. tostring(b['1']) .. tostring(b)",
          "4nilnilMemBlock (4 bytes)"},
         {"b[0] = 1 b[5] = 1 b[1] = 300 b[2] = -1 b[3] = '7' b[4.5] = 8 return bytes(b) =="
-         " '\\44\\255\\0\\8'",
+         " '\\44\\255\\0\\0'",
          "true"},
         {"return bytes(HexData(' 1 fF\\n1ff 0x10 -1\\t7zz 8')) == '\\1\\255\\255\\16\\255\\7'",
          "true"},
+        {"return bytes(HexData('12-3 4')) .. bytes(HexData('+1 2'))", "\x12\x01\x02"},
         {"return tostring(HexData('')) .. tostring(convert(HexData('zz')))",
          "MemBlock (0 bytes)MemBlock (0 bytes)"},
         // Metamethods in the hands of a script.
@@ -354,9 +424,11 @@ TEST(LuaValues, FailingAllocations) {
         luaL_openlibs(L);
         register_memblock(L);
         const char* source =
-            "source = table.ordered{'a', 'bc', 3, 1}\n"
+            "source = ordered{'a', 'bc', 3, 1}\n"
             "source.block = HexData(('1 '):rep(2000))\n"
-            "source.x = {__ctor='P', __flags=256, x=1, 'text', 'nul\\0', [{}]={1}}";
+            "source.x = {__ctor='P', __flags=256, x=1, 'text', 'nul\\0', [{}]={1}}\n"
+            "source.f = function(...) return ..., 1.5 end";
+        RunOrderedTableScript(L);
         ASSERT_EQ(luaL_dostring(L, kPrelude) || luaL_dostring(L, source), 0);
         ScriptVal value;
         Faults::FailAt(++n, false);

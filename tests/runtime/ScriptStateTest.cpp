@@ -369,6 +369,8 @@ TEST_F(ScriptStateTest, KeepsItsConnectionInStep) {
     g_ScriptHooks.m_GetRemoteApp = [](RemoteObject* proxy) {
         return reinterpret_cast<RemoteApp*>(proxy);
     };
+    g_ScriptHooks.m_IncRemoteRef = [](RemoteObject*) {};
+    g_ScriptHooks.m_DecRemoteRef = [](RemoteObject*) {};
     g_RuntimeHooks.m_SetAppTrace = [](RemoteApp*, bool trace) { log += trace ? "on " : "off "; };
     g_RuntimeHooks.m_SetStateData = [](RemoteApp*, const ScriptVal& data) {
         log += data.FindKeyConst("k").ToString("?");

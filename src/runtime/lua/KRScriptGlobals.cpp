@@ -64,6 +64,14 @@ int global_index(lua_State* L) {
 
 }  // namespace
 
+bool IsProbe(lua_State* L) {
+    if (t_Depth == 0) return false;  // on this thread, in any interpreter
+    lua_getfield(L, LUA_REGISTRYINDEX, kIgnoreErrors);
+    bool isProbe = lua_toboolean(L, -1);
+    lua_pop(L, 1);
+    return isProbe;
+}
+
 int activeobj(lua_State* L) {
     lua_settop(L, 1);
     getactiveobj(L);

@@ -10,6 +10,8 @@
 #include "Platform/Lock.h"
 #include "Platform/Time.h"
 #include "runtime/lua/KRScriptLibInternal.h"
+#include "runtime/lua/LuaObject.h"
+#include "runtime/lua/LuaType.h"
 #include "runtime/lua/LuaValues.h"
 
 extern "C" int luaopen_lpeg(lua_State* L);
@@ -157,6 +159,7 @@ extern "C" int luaopen_krscript(lua_State* L) {
         lua_setfield(L, -2, "exit");
     }
     lua_settop(L, orv);
+    Korvel::s_LuaType_RemoteObject.lw_register(L);
     Korvel::RunStartupScripts(L);
     Korvel::SetGlobalIndex(L);
     return 1;

@@ -14,6 +14,9 @@ namespace Korvel {
 int activeobj(lua_State* L);
 int getactiveobj(lua_State* L);
 
+// Whether the globals are looking a name up in the active object: then it is only tried.
+bool IsProbe(lua_State* L);
+
 // Makes the globals look up in the active object what they do not have. A metatable that the
 // globals have got already stays, with another __index.
 void SetGlobalIndex(lua_State* L);
@@ -34,6 +37,12 @@ private:
     const char* m_Text;
     std::atomic<const std::string*> m_Bytecode = nullptr;
 };
+
+// Tells the message on top of the stack to the global _ALERT, if there is one, and pops it.
+void Alert(lua_State* L);
+
+// Defines ordered tables: `table.ordered`, `_orderedtable_meta` and `_orderedtable_next`.
+void RunOrderedTableScript(lua_State* L);
 
 // Runs the scripts that belong to the library. One that fails is told to the global _ALERT, and the
 // next one has its turn.

@@ -8,7 +8,6 @@
 #include <cstring>
 #include <lua.hpp>
 #include <string>
-#include <type_traits>
 
 #include "Platform/NoKillInternal.h"
 #include "core/TextCellInternal.h"
@@ -95,6 +94,7 @@ int mysetdebugtransport(lua_State* L) {
 }
 
 int initffi(lua_State* L) {
+    RunOrderedTableScript(L);
     g_RuntimeHooks.m_InitFFI(L, -1);
     return 0;
 }
@@ -108,21 +108,6 @@ void my_hook(lua_State* L, lua_Debug* record) {
         }
         return 0;
     });
-}
-
-// Work on an interpreter, in C functions that lie in the registry under their own addresses:
-// pushing them from there makes nothing, and so needs no protection itself.
-
-struct Job {
-    void (*m_Run)(lua_State* L, void* work);
-    void* m_Work;
-};
-
-int RunJob(lua_State* L) {
-    Job& job = *static_cast<Job*>(lua_touserdata(L, 1));
-    lua_settop(L, 0);
-    job.m_Run(L, job.m_Work);
-    return lua_gettop(L);
 }
 
 // The message handler of runs: keeps where the error happened for the state's GetTraceback.
@@ -169,21 +154,6 @@ int CallAlert(lua_State* L) {
     lua_insert(L, 1);
     lua_call(L, 1, 0);
     return 0;
-}
-
-void* KeyOf(lua_CFunction function) {
-    return reinterpret_cast<void*>(function);
-}
-
-void Keep(lua_State* L, lua_CFunction function) {
-    lua_pushlightuserdata(L, KeyOf(function));
-    lua_pushcfunction(L, function);
-    lua_rawset(L, LUA_REGISTRYINDEX);
-}
-
-void PushKept(lua_State* L, lua_CFunction function) {
-    lua_pushlightuserdata(L, KeyOf(function));
-    lua_rawget(L, LUA_REGISTRYINDEX);
 }
 
 bool IsInScript(lua_State* L) {
@@ -239,8 +209,7 @@ void Alert(lua_State* L) {
 // has failed, which is then reported. The work holds nothing with a destructor while it calls Lua.
 template <class Work>
 bool Protect(lua_State* L, ScriptState* state, Work&& work) {
-    using Body = std::remove_reference_t<Work>;
-    Job job{[](lua_State* inner, void* data) { (*static_cast<Body*>(data))(inner); }, &work};
+    LuaJob job(work);
     if (!Reserve(L, kSlots)) {
         state->DoError("The script's stack is full.");
         state->DoError("\n");
@@ -474,7 +443,9 @@ void LuaScriptState::_SetGlobal(const char* name, const ScriptVal& value, unsign
     Protect(L, this, [&](lua_State* inner) {
         // Nothing is written to the value; the callbacks that take it as one that may be changed
         // are the host's own.
-        if (!ToLua(GetThisApp(), inner, const_cast<ScriptVal&>(value), nullptr, nullptr, 2)) return;
+        auto& source = const_cast<ScriptVal&>(value);
+        if (!ToLua(GetThisApp(), inner, source, nullptr, nullptr, TOLUA_AskPeer)) return;
+        lua_settop(inner, 1);  // code has any number of results
         lua_setglobal(inner, name);
     });
 }

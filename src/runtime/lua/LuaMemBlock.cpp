@@ -1,3 +1,4 @@
+#include <cctype>
 #include <cstdlib>
 #include <cstring>
 #include <lua.hpp>
@@ -6,6 +7,7 @@
 #include "core/0ReusePool.h"
 #include "core/NumbersInternal.h"
 #include "runtime/lua/LuaMemBlockInternal.h"
+#include "runtime/lua/LuaType.h"
 #include "runtime/lua/LuaValues.h"
 
 namespace Korvel {
@@ -17,21 +19,6 @@ void FreeBlock(MemBlock* block) {
     if (!block) return;
     g_ReusePoolMgr.Free(block->m_Ptr);
     g_ReusePoolMgr.Free(block);
-}
-
-// Null without memory.
-MemBlock* CopyBlock(const MemBlock& bytes) {
-    auto* block = static_cast<MemBlock*>(g_ReusePoolMgr.Alloc(sizeof(MemBlock)));
-    if (!block) return nullptr;
-    *block = MemBlock(bytes.m_Size ? g_ReusePoolMgr.Alloc(bytes.m_Size) : nullptr, bytes.m_Size);
-    if (!bytes.m_Size) return block;
-    if (!block->m_Ptr) return FreeBlock(block), nullptr;
-    if (bytes.m_Ptr) {
-        memcpy(block->m_Ptr, bytes.m_Ptr, bytes.m_Size);
-    } else {
-        memset(block->m_Ptr, 0, bytes.m_Size);
-    }
-    return block;
 }
 
 // Where a userdata of the type with this metatable has its pointer; null for any other value, which
@@ -57,7 +44,7 @@ MemBlock* Self(lua_State* L) {
 uint8_t* ByteOf(lua_State* L, const MemBlock* block) {
     if (!block || lua_type(L, 2) != LUA_TNUMBER) return nullptr;
     double position = lua_tonumber(L, 2);
-    if (!(position >= 1 && position < block->m_Size + 1.0)) return nullptr;
+    if (!(position >= 1 && position <= block->m_Size)) return nullptr;
     return static_cast<uint8_t*>(block->m_Ptr) + (static_cast<uint32_t>(position) - 1);
 }
 
@@ -142,20 +129,22 @@ void TellCollector(lua_State* L, size_t bytes) {
 }
 
 // MemBlock(n): n bytes, all zero. No result for anything but a number from 1 to what 32 bits hold.
-int NewMemBlock(lua_State* L) {
-    double size = lua_type(L, 1) == LUA_TNUMBER ? lua_tonumber(L, 1) : 0;
+int CreateMemBlock(lua_State* L) {
+    double size = lua_tonumber_def(L, 1, 0);
     if (!(size >= 1 && size < 0x1p32)) return 0;
     return PushMemBlock(L, MemBlock(nullptr, static_cast<uint32_t>(size)));
 }
 
-// Reads hexadecimal numbers between white space, up to the first thing that is none, and returns
-// how many there are. Their low 8 bits go to `bytes`, unless it is null.
+// Reads hexadecimal numbers with white space between them, up to where anything else stands, and
+// returns how many there are. Their low 8 bits go to `bytes`, unless it is null.
 uint32_t ReadHex(const char* text, uint8_t* bytes) {
-    for (uint32_t count = 0;; count++) {
+    for (uint32_t count = 0;;) {
         char* end;
         long number = strtol(text, &end, 16);
         if (end == text) return count;
         if (bytes) bytes[count] = static_cast<uint8_t>(number);
+        count++;
+        if (!isspace(static_cast<unsigned char>(*end))) return count;
         text = end;
     }
 }
@@ -172,6 +161,20 @@ int HexData(lua_State* L) {
 
 }  // namespace
 
+MemBlock* NewMemBlock(const MemBlock& bytes) {
+    auto* block = static_cast<MemBlock*>(g_ReusePoolMgr.Alloc(sizeof(MemBlock)));
+    if (!block) return nullptr;
+    *block = MemBlock(bytes.m_Size ? g_ReusePoolMgr.Alloc(bytes.m_Size) : nullptr, bytes.m_Size);
+    if (!bytes.m_Size) return block;
+    if (!block->m_Ptr) return FreeBlock(block), nullptr;
+    if (bytes.m_Ptr) {
+        memcpy(block->m_Ptr, bytes.m_Ptr, bytes.m_Size);
+    } else {
+        memset(block->m_Ptr, 0, bytes.m_Size);
+    }
+    return block;
+}
+
 bool PushMemBlock(lua_State* L, const MemBlock& bytes) {
     luaL_checkstack(L, 4, "no room for a block of bytes");
     TellCollector(L, bytes.m_Size);
@@ -180,7 +183,7 @@ bool PushMemBlock(lua_State* L, const MemBlock& bytes) {
     *slot = nullptr;
     PushMetatable(L);
     lua_setmetatable(L, -2);
-    *slot = CopyBlock(bytes);
+    *slot = NewMemBlock(bytes);
     if (*slot) return true;
     lua_pop(L, 1);
     return false;
@@ -199,7 +202,7 @@ void register_memblock(lua_State* L) {
     lua_pop(L, 1);
     lua_pushcfunction(L, HexData);
     lua_setglobal(L, "HexData");
-    lua_pushcfunction(L, NewMemBlock);
+    lua_pushcfunction(L, CreateMemBlock);
     lua_setglobal(L, "MemBlock");
 }
 

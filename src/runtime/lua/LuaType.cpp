@@ -347,22 +347,8 @@ void PushMetatable(lua_State* L, LuaType* type) {
     MakeMetatable(L, type);
 }
 
-// Pushes a weak table of the registry, made at first use: it holds the userdata of native pointers,
-// and the type names of their metatables.
-void PushCache(lua_State* L, void* key) {
-    lua_pushlightuserdata(L, key);
-    lua_rawget(L, LUA_REGISTRYINDEX);
-    if (lua_istable(L, -1)) return;
-    lua_pop(L, 1);
-    lua_newtable(L);
-    lua_createtable(L, 0, 1);
-    lua_pushliteral(L, "kv");
-    lua_setfield(L, -2, "__mode");
-    lua_setmetatable(L, -2);
-    lua_pushlightuserdata(L, key);
-    lua_pushvalue(L, -2);
-    lua_rawset(L, LUA_REGISTRYINDEX);
-}
+// Caches are weak tables that hold the userdata of native pointers, and the type names of their
+// metatables.
 
 // Pushes what the cache at `cache` has for a native pointer, and returns the userdata's contents.
 void** PushCached(lua_State* L, int cache, void* object) {
@@ -463,7 +449,7 @@ int _LuaType::lw_push(lua_State* L, void* object, unsigned int flags) {
 void lua_pushLuaObject(lua_State* L, void* object, LuaType* type, unsigned int flags) {
     luaL_checkstack(L, LUA_MINSTACK, "pushing an object");
     if (!object || !type) return lua_pushnil(L);
-    PushCache(L, reinterpret_cast<void*>(&lua_pushLuaObject));
+    PushWeakTable(L, reinterpret_cast<void*>(&lua_pushLuaObject));
     int cache = lua_gettop(L);
     if (void** userdata = PushCached(L, cache, object)) {
         // A released userdata is no use, and one of an unrelated type belongs to another object:
@@ -493,7 +479,7 @@ void lua_pushLuaObject(lua_State* L, void* object, LuaType* type, unsigned int f
 void lua_pushobject(lua_State* L, void* object, const char* typeName) {
     luaL_checkstack(L, LUA_MINSTACK, "pushing an object");
     if (!object) return lua_pushnil(L);
-    PushCache(L, reinterpret_cast<void*>(&lua_pushobject));
+    PushWeakTable(L, reinterpret_cast<void*>(&lua_pushobject));
     int cache = lua_gettop(L);
     void** userdata = PushCached(L, cache, object);
     // Whoever releases the pointer of a userdata clears it, and the address may come again.

@@ -5,11 +5,13 @@
 
 namespace Korvel {
 
-extern const char kLegacyScript[];  // scripts/legacy.lua
+extern const char kLegacyScript[];        // scripts/legacy.lua
+extern const char kOrderedTableScript[];  // scripts/orderedtable.lua
 
 namespace {
 
 constinit EmbeddedScript s_Scripts[] = {EmbeddedScript(kLegacyScript)};
+constinit EmbeddedScript s_OrderedTable(kOrderedTableScript);
 
 int Append(lua_State*, const void* bytes, size_t size, void* bytecode) {
     try {
@@ -20,14 +22,17 @@ int Append(lua_State*, const void* bytes, size_t size, void* bytecode) {
     }
 }
 
-// Tells the message on top of the stack, if there is somebody to tell, and pops it.
+void Run(lua_State* L, EmbeddedScript& script) {
+    if (script.Load(L) != 0 || lua_pcall(L, 0, 0, 0) != 0) Alert(L);
+}
+
+}  // namespace
+
 void Alert(lua_State* L) {
     PushGlobalRaw(L, "_ALERT");
     lua_insert(L, -2);
     if (lua_pcall(L, 1, 0, 0) != 0) lua_pop(L, 1);
 }
-
-}  // namespace
 
 int EmbeddedScript::Load(lua_State* L) {
     if (const std::string* bytecode = m_Bytecode.load(std::memory_order_acquire)) {
@@ -49,9 +54,11 @@ void EmbeddedScript::KeepBytecode(lua_State* L) {
 }
 
 void RunStartupScripts(lua_State* L) {
-    for (EmbeddedScript& script : s_Scripts) {
-        if (script.Load(L) != 0 || lua_pcall(L, 0, 0, 0) != 0) Alert(L);
-    }
+    for (EmbeddedScript& script : s_Scripts) Run(L, script);
+}
+
+void RunOrderedTableScript(lua_State* L) {
+    Run(L, s_OrderedTable);
 }
 
 }  // namespace Korvel
