@@ -1,4 +1,4 @@
--- A first script: what ./run shows when it is given no file.
+-- A first script: ./run examples/demo.lua
 print("Hello from korvelscript " .. orv._VERSION .. ", process " .. orv.getpid())
 
 -- LPeg is there without a require: read "width=1920, height=1080" into a table.

@@ -5,6 +5,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <csignal>
+#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -68,6 +70,34 @@ ProcessResult RunProcess(const std::vector<std::string>& argv,
     while (waitpid(pid, &status, 0) < 0 && errno == EINTR) continue;
     return {WIFEXITED(status) ? WEXITSTATUS(status) : -1 - WTERMSIG(status),
             ReadFile(dir.Path("out")), ReadFile(dir.Path("err"))};
+}
+
+HostProcess::HostProcess(const char* program, const char* option) {
+    int ends[2];
+    if (pipe2(ends, O_CLOEXEC) != 0) throw std::runtime_error("no pipe");
+    m_Process = fork();
+    if (m_Process == 0) {
+        dup2(ends[1], STDOUT_FILENO);
+        setenv("KORVEL_ListenAddress", "127.0.0.1", 1);
+        execl(program, program, option, nullptr);
+        _exit(127);
+    }
+    close(ends[1]);
+    FILE* out = fdopen(ends[0], "r");
+    if (fscanf(out, "%u", &m_Port) != 1) m_Port = 0;
+    fclose(out);
+}
+
+HostProcess::~HostProcess() {
+    if (m_Process > 0) End(SIGKILL);
+}
+
+int HostProcess::End(int signal) {
+    int status = 0;
+    kill(m_Process, signal);
+    while (waitpid(m_Process, &status, 0) < 0 && errno == EINTR) continue;
+    m_Process = 0;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : -1 - WTERMSIG(status);
 }
 
 }  // namespace Korvel::Test

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/types.h>
+
 #include <string>
 #include <vector>
 
@@ -33,5 +35,22 @@ struct ProcessResult {
 // its environment.
 ProcessResult RunProcess(const std::vector<std::string>& argv,
                          const std::vector<std::string>& settings = {});
+
+// The example host, as a process.
+class HostProcess {
+public:
+    explicit HostProcess(const char* program, const char* option = nullptr);
+    HostProcess(const HostProcess&) = delete;
+    HostProcess& operator=(const HostProcess&) = delete;
+    ~HostProcess();  // kills it
+
+    unsigned int GetPort() const { return m_Port; }  // 0 when it has not started
+    // Sends a signal and waits for the end. Returns its status as RunProcess does.
+    int End(int signal);
+
+private:
+    pid_t m_Process;
+    unsigned int m_Port = 0;
+};
 
 }  // namespace Korvel::Test

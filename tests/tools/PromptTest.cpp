@@ -16,6 +16,7 @@
 namespace Korvel {
 namespace {
 
+using Test::HostProcess;
 using Test::TempDir;
 
 constexpr int kDeadlineSeconds = 60;
@@ -202,6 +203,33 @@ TEST_F(Prompt, CompletesNames) {
     }
     terminal.Type("coroutine.\t");
     EXPECT_TRUE(Contains(terminal.WaitFor("> coroutine."), "create"));
+}
+
+TEST_F(Prompt, CompletesMembersOfObjects) {
+    HostProcess host(MEDIAHOST);
+    Terminal terminal(m_Home, {"-a", std::to_string(host.GetPort())});
+    terminal.WaitFor("> ");
+    struct Case {
+        const char* typed;
+        const char* shown;
+    };
+    const Case cases[] = {{"app.Timel\t", "app.Timeline"},
+                          {"app.Timeline:GetCl\t", "app.Timeline:GetClips"},
+                          {"app.Timeline.Dur\t", "app.Timeline.Duration"},
+                          {"app:GetTimeo\t", "app:GetTimeout"},
+                          {"app:Cli\t", "app:Clip"},    // makes one
+                          {"app:Titl\t", "app:Titl"}};  // no function
+    for (const Case& c : cases) {
+        terminal.Type(std::string("--") + c.typed + "<\r");
+        std::string shown = terminal.WaitFor("\n> ");
+        EXPECT_TRUE(Contains(shown, std::string(c.shown) + "<")) << shown;
+    }
+    terminal.Type("app.Ti\t");
+    EXPECT_TRUE(Contains(terminal.WaitFor("> app.Ti"), "Timeline  Title"));
+    terminal.Type("\x03");
+    terminal.WaitFor("\n> ");
+    EXPECT_TRUE(Contains(terminal.Run("app:Clip('x', 0)"), "\nMediaHost: A clip takes"));
+    EXPECT_TRUE(Contains(terminal.Run("app.ClassName"), "\nMediaHost\n"));
 }
 
 TEST_F(Prompt, StopsAScriptAndKeepsTheRest) {

@@ -15,7 +15,8 @@ struct Completions {
 };
 
 // For the end of a text: globals and keywords, or behind "a.b." and "a.b:" the fields of a table
-// and of the tables that its metatable looks them up in. Functions of metatables are not called.
+// and of the tables that its metatable looks them up in. Functions of metatables are not called,
+// but an object of an application is asked for its members; behind ":" only for its functions.
 Completions Complete(Runner& runner, std::string_view text);
 
 }  // namespace Korvel::Oxscript

@@ -8,6 +8,9 @@
 #include <lua.hpp>
 
 #include "Platform/Files.h"
+#include "remote/RemoteApp.h"
+#include "remote/ScriptPort.h"
+#include "tools/oxscript/Application.h"
 #include "tools/oxscript/Prompt.h"
 #include "tools/oxscript/Runner.h"
 #include "tools/oxscript/Source.h"
@@ -28,6 +31,8 @@ constexpr char kHelp[] =
     "The script finds its arguments in the table 'arg': 'name=value' as arg.name, all others as\n"
     "arg[1] to arg[arg.n]. The libraries 'orv' and 'lpeg' are there without a require.\n"
     "\n"
+    "  -a PORT        work on the application that listens at a port of this machine, such as\n"
+    "                 it has printed: it is the global 'app'\n"
     "  -e TEXT        run a text, before FILE if there is one\n"
     "  -i             open the prompt afterwards; it sees the globals of FILE\n"
     "  -l LANGUAGE    lua, python, python2 or python3, where the name of FILE does not tell\n"
@@ -36,14 +41,17 @@ constexpr char kHelp[] =
     "  -V, --version  print the version and leave\n"
     "\n"
     "At the prompt an expression shows its values, Tab completes names, Ctrl-C stops what runs or\n"
-    "drops what has been typed, and Ctrl-D leaves. The compiler is off there, so that Ctrl-C "
-    "works\n"
-    "everywhere; jit.on() turns it on.\n"
+    "drops what has been typed, and Ctrl-D leaves. The compiler is off there, so that Ctrl-C\n"
+    "works everywhere; jit.on() turns it on.\n"
+    "\n"
+    "An error of the application that a script has not asked for (app.LastError) is shown when it\n"
+    "ends, at the prompt after each line, and is gone from LastError then.\n"
     "\n"
     "The exit status is the number that the script returns or passes to os.exit, or 0; it is 255\n"
     "for a number outside 0 to 255 and for a script that fails, 2 for a wrong command line.\n";
 
 struct Options {
+    const char* m_Port = nullptr;  // of the application
     std::vector<std::string> m_Texts;
     const char* m_Language = nullptr;
     bool m_IsQuiet = false;
@@ -65,8 +73,11 @@ Start ReadOptions(int argc, char** argv, Options& options) {
         {nullptr, 0, nullptr, 0},
     };
     // The '+' ends the options at the file: what follows belongs to the script.
-    for (int found; (found = getopt_long(argc, argv, "+e:il:qhV", kOptions, nullptr)) != -1;) {
+    for (int found; (found = getopt_long(argc, argv, "+a:e:il:qhV", kOptions, nullptr)) != -1;) {
         switch (found) {
+            case 'a':
+                options.m_Port = optarg;
+                break;
             case 'e':
                 options.m_Texts.push_back(optarg);
                 break;
@@ -162,7 +173,22 @@ bool RunFile(Runner& runner, const Options& options) {
 int RunAll(const Options& options) {
     ScriptLanguage* language = FindLanguage(options);
     if (!language) return kUsageError;
-    Runner runner(language, options.m_Args,
+    ScriptVal app;
+    std::string error;
+    if (options.m_Port) {
+        unsigned int port;
+        if (!ReadPort(options.m_Port, port)) {
+            fprintf(stderr, "%s'%s' is no port: that is a number from 1 to 65535\n", kPrefix,
+                    options.m_Port);
+            return kUsageError;
+        }
+        app = ConnectApplication(port, error);
+    }
+    if (!error.empty()) {
+        fprintf(stderr, "%s%s\n", kPrefix, error.c_str());
+        return kFailure;
+    }
+    Runner runner(language, options.m_Args, app,
                   options.m_WantsPrompt || options.m_IsQuiet ? "" : kPrefix, options.m_WantsPrompt);
     if (!runner.IsReady()) {
         fprintf(stderr, "%snot enough memory for a script\n", kPrefix);
@@ -171,6 +197,10 @@ int RunAll(const Options& options) {
     if (options.m_WantsPrompt && !options.m_IsQuiet) {
         printf("oxscript %s (%s). Tab completes, Ctrl-C stops a script, Ctrl-D leaves.\n",
                OXSCRIPT_VERSION, LUAJIT_VERSION);
+        if (RemoteApp* host = app.GetApp()) {
+            printf("The application is %s, under the name app.\n",
+                   static_cast<const char*>(host->GetName()));
+        }
     }
     bool isGood = true;
     for (const std::string& text : options.m_Texts) {
@@ -192,6 +222,7 @@ int main(int argc, char** argv) {
     if (start.m_Leaves) return start.m_Status;
     KorvelScript::InitLanguages(TagList());
     int status = Oxscript::RunAll(options);
+    CleanupScripting();
     KorvelScript::CleanupLanguages();
     return status;
 }

@@ -12,6 +12,9 @@
 #include <ctime>
 #include <lua.hpp>
 
+#include "remote/RemoteApp.h"
+#include "tools/oxscript/Application.h"
+
 namespace Korvel::Oxscript {
 namespace {
 
@@ -19,6 +22,7 @@ using namespace KorvelScript;
 
 constexpr int kFailedStatus = 255;
 constexpr int kPatienceSeconds = 2;  // that a script has to stop after the first Ctrl-C
+constexpr double kAnswerSeconds = 1;
 
 // For the handler of SIGINT, and for the end of a run
 sem_t s_Wake;                                    // the main thread has something to look at
@@ -160,10 +164,11 @@ std::string Quote(const std::string& text) {
 
 }  // namespace
 
-Runner::Runner(ScriptLanguage* language, std::vector<std::string> args, const char* prefix,
-               bool isInteractive)
+Runner::Runner(ScriptLanguage* language, std::vector<std::string> args, const ScriptVal& app,
+               const char* prefix, bool isInteractive)
     : m_Language(language),
       m_Args(std::move(args)),
+      m_App(app),
       m_Prefix(prefix),
       m_IsInteractive(isInteractive) {
     sem_init(&s_Wake, 0, 0);
@@ -188,6 +193,7 @@ void Runner::Start() {
     m_State->SetPrintFuncs(nullptr, OnError, this);
     m_State->Execute(kDescribeErrors, 0, "=oxscript");
     SetArgs();
+    if (!m_App.IsNil()) m_State->SetGlobal("app", m_App);
     // What a file finds as `globals` is at a prompt the same as _G.
     if (m_IsInteractive) m_State->Execute("jit.off() globals = _G", 0, "=oxscript");
 }
@@ -246,6 +252,8 @@ bool Runner::Run(eScriptMessage type, const std::string& what, const char* name)
     }
     fflush(stdout);
     m_Status = TakeStatus(outcome.m_Result);
+    ShowPendingErrors();
+    TellIfApplicationHasGone();
     return outcome.m_Result == SRES_Done;
 }
 
@@ -267,9 +275,15 @@ int Runner::TakeStatus(unsigned int result) {
 
 std::string Runner::Ask(const std::string& text) {
     std::string answer;
+    RemoteApp* app = m_App.GetApp();
+    double timeOut = app ? app->SetTimeOut(kAnswerSeconds) : 0;
     m_State->SetPrintFuncs(OnAnswer, OnAnswer, &answer);
     unsigned int result = m_State->Execute(text.c_str(), 0, "=oxscript");
     m_State->SetPrintFuncs(nullptr, OnError, this);
+    if (app) {
+        app->SetTimeOut(timeOut);
+        TakePendingErrors();  // those of the question are nobody's
+    }
     return result == SRES_Done ? answer : std::string();
 }
 
@@ -289,6 +303,20 @@ void Runner::ShowError(const char* text) {
     }
     if (!m_HasExited) WriteError(text);
     m_IsLineStart = strcmp(text, "\n") == 0;
+}
+
+void Runner::ShowPendingErrors() {
+    std::string lines = TakePendingErrors();
+    for (size_t start = 0, end; (end = lines.find('\n', start)) != lines.npos; start = end + 1) {
+        WriteError(std::string(m_Prefix).append(lines, start, end + 1 - start).c_str());
+    }
+}
+
+// Once. It may be why a script has failed, or has got nothing but nil.
+void Runner::TellIfApplicationHasGone() {
+    RemoteApp* app = m_App.GetApp();
+    if (!app || app->Connected() || std::exchange(m_HasToldOfEnd, true)) return;
+    WriteError(std::string(m_Prefix).append(app->GetName()).append(" has gone.\n").c_str());
 }
 
 // os.exit ends a script with an empty error and a number in the global _EXITCODE. On its way

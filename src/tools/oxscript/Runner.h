@@ -22,9 +22,9 @@ namespace Korvel::Oxscript {
 //          behind. There is at most one Runner at a time.
 class Runner {
 public:
-    // `args` is the script and its arguments.
+    // `args` is the script and its arguments, `app` the global of that name.
     Runner(KorvelScript::ScriptLanguage* language, std::vector<std::string> args,
-           const char* prefix, bool isInteractive);
+           const ScriptVal& app, const char* prefix, bool isInteractive);
     Runner(const Runner&) = delete;
     Runner& operator=(const Runner&) = delete;
     ~Runner();
@@ -41,7 +41,8 @@ public:
     bool HasExited() const { return m_HasExited; }
     int GetStatus() const { return m_Status; }
 
-    // What a text prints; nothing when it fails, which goes without a message.
+    // What a text prints; nothing when it fails, which goes without a message. The application has
+    // a second for each answer.
     std::string Ask(const std::string& text);
 
 private:
@@ -53,15 +54,19 @@ private:
     void StartAfresh();
     bool Run(KorvelScript::eScriptMessage type, const std::string& what, const char* name);
     void ShowError(const char* text);
+    void ShowPendingErrors();
+    void TellIfApplicationHasGone();
     bool IsExit(const char* text);
     int TakeStatus(unsigned int result);
 
     KorvelScript::ScriptLanguage* const m_Language;
     std::vector<std::string> m_Args;
+    const ScriptVal m_App;
     const char* const m_Prefix;
     const bool m_IsInteractive;
     KorvelScript::ScriptState* m_State = nullptr;  // owned
     int m_Status = 0;
+    bool m_HasToldOfEnd = false;  // of the application
 
     // State's thread while something runs, else main thread
     bool m_HasExited = false;
