@@ -58,7 +58,8 @@ public:
     virtual ~RemoteApp();
 
     // Takes over a connected socket and starts the thread; ends what was connected before. False,
-    // with the socket closed, when there is no thread or no memory.
+    // with the socket closed, without a thread, descriptors or memory, on the connection's own
+    // thread, while another thread connects it, and where the UI thread would wait for itself.
     virtual bool Connect(Platform::_Socket* socket);
     // Connects by address (in network order) and port, within the process where that is its own,
     // and shakes hands; ends what was connected before. False, and not connected, when nobody is
@@ -66,8 +67,9 @@ public:
     // connection has. Without one it takes the peer's. ScriptApp.h tells of `reply`.
     virtual bool Connect(unsigned int ip, unsigned int port, ScriptVal& reply);
 
-    // Ends the connection and waits for its thread, in milliseconds; 0xFFFFFFFF has no limit. False
-    // when it is not connected or the thread has not ended in time.
+    // Ends the connection and waits for its thread to do its last step, in milliseconds; 0xFFFFFFFF
+    // has no limit. On that thread itself it does not wait. False when it was not connected, when
+    // the thread has not ended in time, and where the UI thread would wait for itself.
     virtual bool _Disconnect(unsigned int waitMs);
     virtual void AppThreadFunc();  // the body of the thread
 
@@ -145,7 +147,7 @@ public:
     // Keeps a state's data and sends it to the peer.
     virtual void SetStateData(const ScriptVal& data);
 
-    // Joins two connections within the process. False when one of them is connected.
+    // Joins two connections within the process. False when one of them is connected, or cannot be.
     static bool Join(RemoteApp* a, RemoteApp* b);
 
     // DoPkt for a packet that it takes over in any case; the second form also opens the reply, and

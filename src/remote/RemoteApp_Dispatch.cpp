@@ -124,55 +124,56 @@ bool RemoteApp::OpenReply(Packet* reply) {
     if (!MayNameOurs(*reply)) return false;
     ScriptVal values;
     if (!ScriptVal::FromPacket(this, reply, nullptr, &values)) Close(kNoValues);
-    Request* request;
-    bool isAsleep = false;
+    const Waiter* asleep = nullptr;
     {
         AutoAppLock guard(m_Lock);
-        request = m_Traffic->m_WhyClosed ? nullptr : m_Traffic->m_Requests.Find(reply->m_Context);
-        if (request && !request->m_Waiter.IsOver()) {
+        Request* request = m_Traffic->m_Requests.Find(reply->m_Context);
+        if (request && !request->m_Waiter.IsOver() && !m_Traffic->m_WhyClosed) {
             request->m_Values = std::move(values);
             request->m_HasValues = true;
-            isAsleep = request->m_Waiter.EndQuietly();
+            if (request->m_Waiter.EndQuietly()) asleep = &request->m_Waiter;
         }
     }
-    if (isAsleep) Waiter::WakeUp(&request->m_Waiter);
+    if (asleep) Waiter::WakeUp(asleep);
     return true;
 }
 
 void RemoteApp::HandleReply(Packet* reply) {
     if (OpenReply(reply)) return FreePkt(reply);
-    Request* request;
-    bool isAsleep = false;
+    Request* async = nullptr;
+    const Waiter* asleep = nullptr;
     {
         AutoAppLock guard(m_Lock);
         Traffic& traffic = *m_Traffic;
-        request = traffic.m_Requests.Find(reply->m_Context);
+        Request* request = traffic.m_Requests.Find(reply->m_Context);
         if (!request && traffic.m_NumSilent) traffic.m_NumSilent--;
         if (request && request->m_IsAsync) {
             traffic.m_Requests.Remove(request);
+            async = request;
         } else if (request && !request->m_Waiter.IsOver()) {
+            // From here on its waiter may end it.
             request->m_Reply = std::exchange(reply, nullptr);
-            isAsleep = request->m_Waiter.EndQuietly();
+            if (request->m_Waiter.EndQuietly()) asleep = &request->m_Waiter;
         }
     }
-    if (isAsleep) Waiter::WakeUp(&request->m_Waiter);
+    if (asleep) Waiter::WakeUp(asleep);
     if (!reply) return;
-    if (!request || !request->m_IsAsync) {
+    if (!async) {  // nobody asks for it any more
         Drop(reply);
         return FreePkt(reply);
     }
-    if (request->m_Callback(request->m_Data, this, reply, request->m_Context)) {
-        delete request;
+    if (async->m_Callback(async->m_Data, this, reply, async->m_Context)) {
+        delete async;
         return;
     }
     // It stays until somebody asks for it.
-    request->m_IsAsync = false;
-    request->m_Callback = nullptr;
-    request->m_DeadlineNs = 0;
-    request->m_Reply = reply;
-    request->m_Waiter.End();
+    async->m_IsAsync = false;
+    async->m_Callback = nullptr;
+    async->m_DeadlineNs = 0;
+    async->m_Reply = reply;
+    async->m_Waiter.End();
     AutoAppLock guard(m_Lock);
-    m_Traffic->m_Requests.Add(request);
+    m_Traffic->m_Requests.Add(async);
 }
 
 void RemoteApp::HandleRequest(Packet* packet) {

@@ -173,6 +173,32 @@ TEST_F(Faulty, PeersThatDoNotAnswerReleases) {
     EXPECT_LT(CountBytes(), before + (1 << 20));
 }
 
+// The second reply may come at the moment when the waiter takes the first.
+TEST_F(Faulty, PeersThatAnswerTwice) {
+    Bare peer;
+    constexpr int kNumCalls = 2000;
+    std::thread answers([&] {
+        std::string reply = Write(CreatePkt(PKT_Reply, nullptr, nullptr, nullptr));
+        for (int i = 0; i < kNumCalls; i++) {
+            Packet* request = peer.Receive();
+            ASSERT_NE(request, nullptr);
+            memcpy(reply.data() + offsetof(Packet, m_Context), &request->m_Context, 4);
+            FreePkt(request);
+            std::string twice = reply + reply;
+            peer.Send(twice.data(), static_cast<uint32_t>(twice.size()));
+        }
+    });
+    int numAnswered = 0;
+    for (int i = 0; i < kNumCalls; i++) {
+        Packet* reply = peer.m_App->ExchangePkt(CreatePkt(PKT_IncRef, nullptr, nullptr, nullptr));
+        if (!reply) break;
+        FreePkt(reply);
+        numAnswered++;
+    }
+    answers.join();
+    EXPECT_EQ(numAnswered, kNumCalls);
+}
+
 TEST_F(Faulty, OneByteAtATime) {
     Bare peer;
     std::string stream = MakeRequest() + MakeRequest(80000) + MakeRequest();
