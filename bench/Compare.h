@@ -12,6 +12,8 @@
 // faster.
 namespace Korvel::Bench {
 
+constexpr double kNsPerSecond = 1e9;
+
 class CompareReporter : public benchmark::ConsoleReporter {
 public:
     // With repetitions the median counts, else the single run.
@@ -21,21 +23,25 @@ public:
                                                   : run.repetitions > 1) {
                 continue;
             }
-            std::string name = run.run_name.str();
+            const std::string& name = run.run_name.function_name;
             size_t at = name.find('@');
             if (at == std::string::npos || run.error_occurred) continue;
-            size_t end = name.find('/', at);
-            std::string rest = end == std::string::npos ? "" : name.substr(end);
+            std::string row = name.substr(0, at);
+            for (const std::string* part : {&run.run_name.args, &run.run_name.threads}) {
+                if (!part->empty()) row.append("/").append(*part);
+            }
             // With several threads the library divides by the sum of what they have done.
-            Add(name.substr(0, at) + rest, name.substr(at + 1, end - at - 1),
-                run.GetAdjustedRealTime() * static_cast<double>(run.threads));
+            Add(row, name.substr(at + 1),
+                run.GetAdjustedRealTime() * kNsPerSecond /
+                    benchmark::GetTimeUnitMultiplier(run.time_unit) *
+                    static_cast<double>(run.threads));
         }
         ConsoleReporter::ReportRuns(runs);
     }
 
     void PrintTable() const {
         printf("\n%-44s", "ns an operation (ratio of the first)");
-        for (const std::string& variant : m_Variants) printf("%18s", variant.c_str());
+        for (const std::string& variant : m_Variants) printf(" %19s", variant.c_str());
         printf("\n");
         for (const std::string& row : m_Rows) {
             printf("%-44s", row.c_str());
@@ -44,11 +50,11 @@ public:
             for (const std::string& variant : m_Variants) {
                 auto found = times.find(variant);
                 if (found == times.end()) {
-                    printf("%18s", "-");
+                    printf(" %19s", "-");
                 } else if (found == own || own == times.end()) {
-                    printf("%18.2f", found->second);
+                    printf(" %19.2f", found->second);
                 } else {
-                    printf("%11.2f (%4.2f)", found->second, own->second / found->second);
+                    printf(" %12.2f (%4.2f)", found->second, own->second / found->second);
                 }
             }
             printf("\n");

@@ -35,6 +35,11 @@ constexpr Program kPrograms[] = {
      "function work() for i = 1, 100000 do make(i)() local o = setmetatable({ i = i }, M) end end"},
     {"arithmetic and loops",
      "function work() local x = 0 for i = 1, 2000000 do x = x + i % 7 * 2 / 3 - i end end"},
+    // In time by the square here; the distribution's has plain ones only.
+    {"ordered tables of 500 keys",
+     "local order = sethashstate or function() end local k = {} for i = 1, 500 do k[i] = 'k' .. i "
+     "end function work() for n = 1, 20 do order(0) local t = {} for i = 1, 500 do t[k[i]] = i end "
+     "end end"},
 };
 
 constexpr const char* kTail =

@@ -136,7 +136,7 @@ bool State::ToString(Value* place) {
 
 double State::CheckNumber(int i) {
     double number;
-    if (!ToNumber(Arg(i), number)) TypeError(i, "number");
+    if (!ReadNumber(Arg(i), number)) TypeError(i, "number");
     return number;
 }
 

@@ -14,12 +14,14 @@ namespace {
 
 int BasePrint(State& L) {
     int count = L.GetArgCount();
-    L.PushField(L.m_Globals, "tostring");
+    L.PushString("tostring");
+    L.GetIndex(Value::Of(L.m_Globals), L.m_Top[-1], L.m_Top - 1);
     for (int i = 1; i <= count; i++) {
         L.Push(L.m_Base[count]);
         L.Push(L.m_Base[i - 1]);
         L.Call(1, 1);
         if (!L.ToString(L.m_Top - 1)) L.Error("'tostring' must return a string to 'print'");
+        L.Charge(L.m_Top[-1].AsString()->m_Length / 16);
         if (i > 1) putchar('\t');
         fputs(L.m_Top[-1].AsString()->GetText(), stdout);
         L.Pop();
@@ -33,7 +35,7 @@ int BaseToNumber(State& L) {
     if (base == 10) {
         L.CheckAny(1);
         double number;
-        if (!State::ToNumber(L.Arg(1), number)) {
+        if (!L.ReadNumber(L.Arg(1), number)) {
             L.PushNil();
         } else {
             L.PushNumber(number);
@@ -41,6 +43,7 @@ int BaseToNumber(State& L) {
         return 1;
     }
     const char* text = L.CheckString(1)->GetText();
+    L.Charge(L.Arg(1).AsString()->m_Length / 64);
     if (base < 2 || base > 36) L.ArgError(2, "base out of range");
     char* end;
     unsigned long number = strtoul(text, &end, base);
@@ -120,8 +123,8 @@ int BaseGetFenv(State& L) {
 int BaseSetFenv(State& L) {
     Table* environment = L.CheckTable(2);
     PushFunctionAt(L, false);
-    const Value& target = L.Arg(1);
-    if (target.IsNumber() && target.m_Number == 0) {  // the thread's own
+    double level;
+    if (State::ToNumber(L.Arg(1), level) && level == 0) {  // the thread's own
         L.m_Globals = environment;
         L.GetMachine().Barrier(&L, environment);
         return 0;
@@ -224,7 +227,7 @@ int BasePairs(State& L) {
 
 int IpairsStep(State& L) {
     Table* table = L.CheckTable(1);
-    auto i = static_cast<int>(L.CheckInteger(2)) + 1;
+    auto i = static_cast<int>(L.CheckInteger(2) + 1);
     L.ChargeAccess(table);
     const Value value = *table->Get(i);
     L.PushNumber(i);
@@ -427,7 +430,10 @@ void OpenBase(State& L, BaseLevel level) {
     L.Pop();
     PushIterator(L, "ipairs", BaseIpairs, IpairsStep);
     PushIterator(L, "pairs", BasePairs, BaseNext);
-    if (level == BaseLevel::Foreign) return;
+    if (level == BaseLevel::Foreign) {
+        L.SetField(globals, "print", Value::Nil());
+        return;
+    }
     RegisterLoading(L);
     Table* known = L.PushTable();
     known->m_Metatable = known;

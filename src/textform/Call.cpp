@@ -54,6 +54,14 @@ void State::ShrinkCalls() {
     if (size > kMaxCalls && m_Call - m_Calls + 1 < kMaxCalls) ResizeCalls(kMaxCalls);
 }
 
+void State::ShrinkStacks(const Value* end) {
+    auto calls = static_cast<int>(m_CallsEnd - m_Calls);
+    if (calls > kMaxCalls) return;  // an overflow is being handled
+    if (m_Call - m_Calls < calls / 4 && calls > 16) ResizeCalls(calls / 2);
+    auto size = static_cast<int>(m_StackEnd - m_Stack);
+    if (end - m_Stack < size / 4 && size > 4 * kMinStack) ResizeStack(size / 2);
+}
+
 bool State::TryNeedStack(int count) {
     if (count > kMaxNativeStack || m_Top - m_Base + count > kMaxNativeStack) return false;
     if (count > 0) {

@@ -92,15 +92,18 @@ bool Checker::FindInnerWords() {
     return !m_IsInner[count - 1];
 }
 
-// What takes all results up to the top must stand right behind what leaves them.
+// What takes all results up to the top must stand right behind what leaves them, and begin below:
+// there may be none.
 bool Checker::CheckOpenResults(int pc) const {
+    int first = GetA(m_P->m_Code[pc]);
     Instruction next = m_P->m_Code[pc + 1];
     switch (GetOp(next)) {
         case Op::Call:
         case Op::TailCall:
-        case Op::Return:
         case Op::SetList:
-            return GetB(next) == 0;
+            return GetB(next) == 0 && GetA(next) < first;
+        case Op::Return:
+            return GetB(next) == 0 && GetA(next) <= first;
         default:
             return false;
     }
@@ -143,10 +146,11 @@ bool Checker::CheckRegisters(int pc) const {
         case Op::TForLoop:
             return c >= 1 && IsRegister(a + 2 + c) && IsRegister(a + 5);
         case Op::Call:
-        case Op::TailCall:
             if (b != 0 && !IsRegister(a + b - 1)) return false;
-            if (c == 0) return CheckOpenResults(pc);
-            return IsRegister(a + c - 2 < 0 ? 0 : a + c - 2);
+            return c == 0 ? CheckOpenResults(pc) : c == 1 || IsRegister(a + c - 2);
+        case Op::TailCall:  // a native function's results are returned by what follows
+            if (b != 0 && !IsRegister(a + b - 1)) return false;
+            return c == 0 && GetOp(m_P->m_Code[pc + 1]) == Op::Return && CheckOpenResults(pc);
         case Op::Return:
             return b < 2 || IsRegister(a + b - 2);
         case Op::SetList:

@@ -81,7 +81,7 @@ void FunctionCode::EmitSetList(int base, int itemCount, int toStore) {
         EmitABC(Op::SetList, base, count, flush);
     } else {
         EmitABC(Op::SetList, base, count, 0);
-        Emit(static_cast<Instruction>(flush));
+        m_ListNumbers.push_back(Emit(static_cast<Instruction>(flush)));
     }
     m_FreeRegister = base + 1;
 }
@@ -119,14 +119,17 @@ void FunctionCode::Join(int& list, int other) {
         return;
     }
     int last = list;
-    for (int next; (next = GetJump(last)) != kNoJump;) last = next;
+    size_t steps = 0;
+    for (int next; (next = GetJump(last)) != kNoJump; steps++) last = next;
+    m_State.Charge(steps / 16);
     FixJump(last, other);
 }
 
 // The test that decides whether a jump is taken, else the jump itself.
 Instruction& FunctionCode::GetControl(int pc) {
-    if (pc >= 1 && IsTest(GetOp(At(pc - 1)))) return At(pc - 1);
-    return At(pc);
+    if (pc < 1 || !IsTest(GetOp(At(pc - 1)))) return At(pc);
+    bool isNumber = std::binary_search(m_ListNumbers.begin(), m_ListNumbers.end(), pc - 1);
+    return At(isNumber ? pc : pc - 1);
 }
 
 // Whether a jump of the list leaves no value in a register.
@@ -187,7 +190,7 @@ int FunctionCode::AddConstant(const Value& key, const Value& value) {
     if (slot->IsNumber()) return static_cast<int>(slot->m_Number);
     Prototype* p = m_Prototype;
     int index = p->m_ConstantCount;
-    if (index >= kMaxConstants) m_Lexer.Fail("constant table overflow");
+    if (index >= kMaxConstants) m_State.RunError("constant table overflow");
     *slot = Value::Number(index);
     m_State.GetMachine().Grow(p->m_Constants, m_ConstantCapacity, index + 1);
     p->m_Constants[index] = value;
@@ -237,7 +240,7 @@ void FunctionCode::DeclareLocal(String* name, int index) {
     CheckLimit(m_ActiveCount + index + 1, kMaxLocals, "local variables");
     Prototype* p = m_Prototype;
     int place = p->m_LocalCount;
-    if (place > SHRT_MAX) m_Lexer.Fail("too many local variables");
+    if (place > SHRT_MAX) m_State.RunError("too many local variables");
     m_State.GetMachine().Grow(p->m_Locals, m_LocalCapacity, place + 1);
     p->m_Locals[place] = {name, 0, 0};
     p->m_LocalCount = place + 1;
@@ -298,7 +301,7 @@ void FunctionCode::LeaveBlock() {
 int FunctionCode::AddPrototype(Prototype* prototype) {
     Prototype* p = m_Prototype;
     int index = p->m_PrototypeCount;
-    if (index > kMaxBx) m_Lexer.Fail("constant table overflow");
+    if (index > kMaxBx) m_State.RunError("constant table overflow");
     m_State.GetMachine().Grow(p->m_Prototypes, m_PrototypeCapacity, index + 1);
     p->m_Prototypes[index] = prototype;
     p->m_PrototypeCount = index + 1;

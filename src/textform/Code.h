@@ -5,6 +5,8 @@
 // list through their own offset fields, ended by kNoJump.
 #pragma once
 
+#include <vector>
+
 #include "textform/Opcodes.h"
 #include "textform/State.h"
 
@@ -199,7 +201,8 @@ private:
     int m_LocalCapacity = 0;
     int m_UpValueCapacity = 0;
     bool m_IsFinished = false;
-    uint16_t m_Active[kMaxLocals];  // the locals alive, as indices into the prototype's
+    std::vector<int> m_ListNumbers;  // places of words that are numbers of a SetList's items
+    uint16_t m_Active[kMaxLocals];   // the locals alive, as indices into the prototype's
 };
 
 }  // namespace Korvel::TextForm

@@ -234,6 +234,8 @@ int FunctionCode::JumpOn(Expression& e, bool condition) {
     return EmitCondition(Op::TestSet, kMaxA, e.m_Info, condition);
 }
 
+// A constant that always jumps is tested like any value: a jump without a test would take along
+// those that wait for this place, and their tests would store into the expression's register.
 void FunctionCode::JumpIfFalse(Expression& e) {
     Discharge(e);
     int jump;
@@ -242,9 +244,6 @@ void FunctionCode::JumpIfFalse(Expression& e) {
         case Expression::Number:
         case Expression::True:
             jump = kNoJump;
-            break;
-        case Expression::False:
-            jump = EmitJump();
             break;
         case Expression::Jump:
             InvertJump(e);
@@ -265,9 +264,6 @@ void FunctionCode::JumpIfTrue(Expression& e) {
         case Expression::Nil:
         case Expression::False:
             jump = kNoJump;
-            break;
-        case Expression::True:
-            jump = EmitJump();
             break;
         case Expression::Jump:
             jump = e.m_Info;

@@ -4,6 +4,7 @@
 // are done. No black object refers to a white one; the barriers see to that while programs run in
 // between. There are two whites: those of the last cycle are what a sweep frees.
 #include <algorithm>
+#include <utility>
 
 #include "textform/State.h"
 
@@ -181,7 +182,8 @@ size_t Machine::Traverse(State* thread) {
     Value* place = thread->m_Stack;
     for (; place < thread->m_Top; place++) Mark(*place);
     end = std::min(end, thread->m_Stack + thread->m_StackSize - 1);
-    for (; place <= end; place++) *place = g_Nil;
+    for (Value* p = place; p <= end; p++) *p = g_Nil;
+    thread->ShrinkStacks(end);
     return sizeof(State) + thread->m_StackSize * sizeof(Value);
 }
 
@@ -379,6 +381,7 @@ size_t Machine::SingleStep(State& L) {
                 m_Phase = Phase::SweepUserdata;
             } else {
                 m_Strings.ShrinkIfEmpty(*this);
+                FreeArray(std::exchange(m_Scratch, nullptr), std::exchange(m_ScratchSize, 0));
                 m_Phase = Phase::Finalize;
             }
             return kSweepCount * kSweepCost;
@@ -404,16 +407,20 @@ void Machine::StepGc(State& L) {
     size_t limit = kStepSize / 100 * static_cast<size_t>(std::max(m_StepFactor, 0));
     if (limit == 0) limit = SIZE_MAX / 2;
     m_Debt += m_Heap.GetUsed() - std::min(m_Threshold, m_Heap.GetUsed());
-    for (size_t done = 0; done < limit;) {
+    size_t done = 0;
+    while (done < limit) {
         done += SingleStep(L);
-        if (m_Phase == Phase::Pause) return SetThreshold();
+        if (m_Phase == Phase::Pause) break;
     }
-    if (m_Debt < kStepSize) {
+    if (m_Phase == Phase::Pause) {
+        SetThreshold();
+    } else if (m_Debt < kStepSize) {
         m_Threshold = m_Heap.GetUsed() + kStepSize;
     } else {
         m_Debt -= kStepSize;
         m_Threshold = m_Heap.GetUsed();
     }
+    L.Charge(done / 1024);  // a program sets how often a collection begins
 }
 
 bool Machine::StepGcBy(State& L, int kilobytes) {
@@ -443,8 +450,7 @@ void Machine::CollectAll(State& L) {
     SetThreshold();
 }
 
-void Machine::RunAllFinalizers(State& L) {
-    SeparateUserdata(true);
+void Machine::RunWaitingFinalizers(State& L) {
     while (m_ToFinalize) RunFinalizer(L);
 }
 

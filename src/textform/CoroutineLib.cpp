@@ -62,7 +62,7 @@ int WrapStep(State& L) {
     auto* thread = static_cast<State*>(L.GetUpValue(1).m_Object);
     int count = ResumeWith(L, thread, L.GetArgCount());
     if (count >= 0) return count;
-    if (L.m_Top[-1].IsString()) {  // say where, too
+    if (L.m_Top[-1].IsString() || L.m_Top[-1].IsNumber()) {  // say where, too
         L.PushWhere(1);
         L.Insert(L.GetArgCount() - 1);
         Concat(L, 2);

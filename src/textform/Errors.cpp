@@ -170,14 +170,9 @@ void Machine::RaiseMemoryError() {
     throw Raised{Status::LimitError};
 }
 
-void State::RaiseLimit() {
-    if (m_Machine->m_Exceeded == Status::Ok) m_Machine->m_Exceeded = Status::LimitError;
-    Throw(Status::LimitError);
-}
-
-void State::Spend(size_t work) {
-    m_Machine->m_Budget -= static_cast<int64_t>(work);
-    if (m_Machine->m_Budget < 0) RaiseLimit();
+void Machine::RaiseLimit() {
+    if (m_Exceeded == Status::Ok) m_Exceeded = Status::LimitError;
+    throw Raised{Status::LimitError};
 }
 
 void State::ThrowValue() {

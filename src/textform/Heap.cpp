@@ -26,8 +26,10 @@ Heap::~Heap() {
 void* Heap::Cut(size_t index, size_t size) {
     size_t rounded = index * 16;
     if (rounded > m_ChunkRest) {
+        if (m_InChunks >= m_Limit) return nullptr;  // blocks of one size do not become others
         auto* chunk = static_cast<Chunk*>(malloc(m_NextChunkSize));
         if (!chunk) return nullptr;
+        m_InChunks += m_NextChunkSize;
         chunk->m_Next = m_Chunks;
         m_Chunks = chunk;
         m_ChunkPlace = reinterpret_cast<char*>(chunk + 1);
@@ -60,19 +62,26 @@ void Heap::FreeLarge(void* p, size_t size) {
     free(block);
 }
 
+// A block that is larger than its size says serves as one of that size, on any list.
+void* Heap::KeepShrunk(void* p, size_t oldSize, size_t newSize) {
+    if (newSize > oldSize) return nullptr;
+    m_Used -= oldSize - newSize;
+    return p;
+}
+
 void* Heap::Reallocate(void* p, size_t oldSize, size_t newSize) {
     if (p && GetIndex(oldSize) >= kClassCount && GetIndex(newSize) >= kClassCount) {
         if (newSize > oldSize && newSize - oldSize > m_Limit - m_Used) return nullptr;
         auto* moved = static_cast<LargeBlock*>(
             realloc(static_cast<LargeBlock*>(p) - 1, sizeof(LargeBlock) + newSize));
-        if (!moved) return newSize <= oldSize ? p : nullptr;
+        if (!moved) return KeepShrunk(p, oldSize, newSize);
         *moved->m_Link = moved;
         if (moved->m_Next) moved->m_Next->m_Link = &moved->m_Next;
         m_Used += newSize - oldSize;
         return moved + 1;
     }
     void* block = Allocate(newSize);
-    if (!block) return nullptr;
+    if (!block) return KeepShrunk(p, oldSize, newSize);
     if (p) memcpy(block, p, std::min(oldSize, newSize));
     Free(p, oldSize);
     return block;

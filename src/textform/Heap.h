@@ -75,12 +75,14 @@ private:
     void* Cut(size_t index, size_t size);
     void* AllocateLarge(size_t size);
     void FreeLarge(void* p, size_t size);
+    void* KeepShrunk(void* p, size_t oldSize, size_t newSize);
 
     size_t m_Used = 0;
     size_t m_Limit = SIZE_MAX / 2;
     char* m_ChunkPlace = nullptr;  // where the next small block is cut
     size_t m_ChunkRest = 0;
     size_t m_NextChunkSize = 16 * 1024;
+    size_t m_InChunks = 0;
     Chunk* m_Chunks = nullptr;
     LargeBlock* m_Large = nullptr;
     FreeBlock* m_Free[kClassCount + 1] = {};

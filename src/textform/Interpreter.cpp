@@ -52,9 +52,10 @@ Interpreter::~Interpreter() {
     L.m_Base = L.m_Top = L.m_Call->m_Base;
     L.m_NativeCalls = 0;
     Machine::GcPause pause(m_Machine);
+    m_Machine.ReleaseUserdata();  // once: what finalisers make goes without
     Status status;
     do {  // a finaliser that fails is no reason to leave the others out
-        status = L.RunProtected([&] { m_Machine.RunAllFinalizers(L); }, L.m_Base, 0);
+        status = L.RunProtected([&] { m_Machine.RunWaitingFinalizers(L); }, L.m_Base, 0);
         L.m_Top = L.m_Base;
     } while (status != Status::Ok && status != Status::LimitError);
 }

@@ -54,7 +54,8 @@ Table* OpenLibrary(State& L, const char* name, std::span<const NativeEntry> entr
 
 enum class BaseLevel : uint8_t {
     Full,
-    // For foreign text: nothing that compiles, reads files or makes coroutines and userdata.
+    // For foreign text: nothing that compiles, reads files, prints or makes coroutines and
+    // userdata.
     Foreign,
 };
 void OpenBase(State& L, BaseLevel level = BaseLevel::Full);

@@ -85,8 +85,8 @@ public:
     template <class T>
     void Grow(T*& array, int& capacity, int needed) {
         if (needed <= capacity) return;
-        int wanted = capacity < 4 ? 4 : capacity * 2;
-        if (wanted < needed) wanted = needed;
+        int wanted = capacity > INT32_MAX / 2 ? INT32_MAX : capacity * 2;
+        if (wanted < needed) wanted = needed < 4 ? 4 : needed;
         array = ResizeArray(array, capacity, wanted);
         capacity = wanted;
     }
@@ -146,7 +146,9 @@ public:
     bool StepGcBy(State& L, int kilobytes);
     void StopGc() { m_Threshold = SIZE_MAX; }
     void RestartGc() { m_Threshold = m_Heap.GetUsed(); }
-    void RunAllFinalizers(State& L);
+    // At the end of a machine: all userdata that have a finaliser wait for its call.
+    void ReleaseUserdata() { SeparateUserdata(true); }
+    void RunWaitingFinalizers(State& L);
     // To be called when an up-value takes its value along.
     void BarrierClosed(UpValue* upValue);
 
@@ -184,6 +186,11 @@ public:
     int64_t m_Budget = 0;
     bool m_IsLimited = false;
     Status m_Exceeded = Status::Ok;
+    [[noreturn]] void RaiseLimit();
+    void Spend(size_t work) {
+        m_Budget -= static_cast<int64_t>(work);
+        if (m_Budget < 0) RaiseLimit();
+    }
 
     // The values of errors that can't be made any more when they are needed.
     String* m_MemoryMessage = nullptr;

@@ -15,10 +15,11 @@ int MathUnary(State& L) {
     return 1;
 }
 
+// The last argument is the first to be missed, as in the distribution's.
 template <double (*kFunction)(double, double)>
 int MathBinary(State& L) {
-    double first = L.CheckNumber(1);
-    L.PushNumber(kFunction(first, L.CheckNumber(2)));
+    double second = L.CheckNumber(2);
+    L.PushNumber(kFunction(L.CheckNumber(1), second));
     return 1;
 }
 
@@ -46,8 +47,8 @@ int MathFrexp(State& L) {
 }
 
 int MathLdexp(State& L) {
-    double number = L.CheckNumber(1);
-    L.PushNumber(std::ldexp(number, L.CheckInt(2)));
+    int exponent = L.CheckInt(2);
+    L.PushNumber(std::ldexp(L.CheckNumber(1), exponent));
     return 1;
 }
 

@@ -181,14 +181,10 @@ void State::SetIndex(const Value& object, const Value& key, const Value& value) 
         if (holder.IsTable()) {
             Table* table = holder.AsTable();
             ChargeAccess(table);
-            auto* slot = const_cast<Value*>(table->Get(keyCopy));
-            if (slot->IsNil()) {
-                method = m_Machine->GetFastMeta(table->m_Metatable, Event::NewIndex);
-            } else {
-                method = nullptr;
-            }
+            Value* slot = SetSlot(*this, table, keyCopy);
+            method = slot->IsNil() ? m_Machine->GetFastMeta(table->m_Metatable, Event::NewIndex)
+                                   : nullptr;
             if (!method) {
-                if (slot->IsNil()) slot = SetSlot(*this, table, keyCopy);
                 *slot = valueCopy;
                 m_Machine->BarrierBack(table, valueCopy);
                 return;
@@ -238,7 +234,7 @@ double Calculate(Op op, double a, double b) {
 void Arithmetic(State& L, Op op, const Value* a, const Value* b, Value* result) {
     double first;
     double second;
-    if (State::ToNumber(*a, first) && State::ToNumber(*b, second)) {
+    if (L.ReadNumber(*a, first) && L.ReadNumber(*b, second)) {
         *result = Value::Number(Calculate(op, first, second));
         return;
     }
@@ -247,8 +243,10 @@ void Arithmetic(State& L, Op op, const Value* a, const Value* b, Value* result) 
     CallMethodInto(L, *method, *a, *b, result);
 }
 
-static int CompareText(const String* a, const String* b) {
-    int order = memcmp(a->GetText(), b->GetText(), std::min(a->m_Length, b->m_Length));
+static int CompareText(State& L, const String* a, const String* b) {
+    size_t common = std::min(a->m_Length, b->m_Length);
+    L.Charge(common / 256);
+    int order = memcmp(a->GetText(), b->GetText(), common);
     if (order) return order;
     return a->m_Length < b->m_Length ? -1 : a->m_Length > b->m_Length;
 }
@@ -256,7 +254,7 @@ static int CompareText(const String* a, const String* b) {
 bool LessThan(State& L, const Value* a, const Value* b) {
     if (a->m_Type != b->m_Type) L.CompareError(a, b);
     if (a->IsNumber()) return a->m_Number < b->m_Number;
-    if (a->IsString()) return CompareText(a->AsString(), b->AsString()) < 0;
+    if (a->IsString()) return CompareText(L, a->AsString(), b->AsString()) < 0;
     Answer answer = AskOrder(L, *a, *b, Event::Lt);
     if (answer == Answer::NoMethod) L.CompareError(a, b);
     return answer == Answer::Yes;
@@ -265,15 +263,11 @@ bool LessThan(State& L, const Value* a, const Value* b) {
 bool LessEqual(State& L, const Value* a, const Value* b) {
     if (a->m_Type != b->m_Type) L.CompareError(a, b);
     if (a->IsNumber()) return a->m_Number <= b->m_Number;
-    if (a->IsString()) return CompareText(a->AsString(), b->AsString()) <= 0;
-    ptrdiff_t first = L.GetOffset(a);
-    ptrdiff_t second = L.GetOffset(b);
-    const Value copyA = *a;
-    const Value copyB = *b;
-    Answer answer = AskOrder(L, copyA, copyB, Event::Le);
+    if (a->IsString()) return CompareText(L, a->AsString(), b->AsString()) <= 0;
+    Answer answer = AskOrder(L, *a, *b, Event::Le);
     if (answer != Answer::NoMethod) return answer == Answer::Yes;
-    answer = AskOrder(L, copyB, copyA, Event::Lt);
-    if (answer == Answer::NoMethod) L.CompareError(L.GetPlace(first), L.GetPlace(second));
+    answer = AskOrder(L, *b, *a, Event::Lt);
+    if (answer == Answer::NoMethod) L.CompareError(a, b);
     return answer == Answer::No;
 }
 
@@ -303,6 +297,7 @@ bool State::Less(const Value& a, const Value& b) {
 
 void GetLengthOf(State& L, const Value* operand, Value* result) {
     if (operand->IsTable()) {
+        L.ChargeAccess(operand->AsTable());
         *result = Value::Number(GetLength(operand->AsTable()));
     } else if (operand->IsString()) {
         *result = Value::Number(static_cast<double>(operand->AsString()->m_Length));

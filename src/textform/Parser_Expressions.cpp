@@ -86,6 +86,7 @@ Expression::Kind Parser::FindIn(FunctionCode* code, String* name, Expression& e,
         e = Expression(Expression::Global, 0);
         return e.m_Kind;
     }
+    m_State.Charge(static_cast<size_t>(code->m_ActiveCount) / 64);
     int local = code->FindLocal(name);
     if (local >= 0) {
         e = Expression(Expression::Local, local);

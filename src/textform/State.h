@@ -142,18 +142,22 @@ public:
     void PushField(Table* table, std::string_view name);
     // Whether a value is a number or a text that reads as one.
     static bool ToNumber(const Value& value, double& number);
+    // The same for values of any length: reading takes time.
+    bool ReadNumber(const Value& value, double& number) {
+        if (value.IsString()) Charge(value.AsString()->m_Length / 64);
+        return ToNumber(value, number);
+    }
     bool ToString(Value* place);  // makes a number a string
 
     // ---- Limits
     // Counts work that takes longer than an instruction.
     void Charge(size_t work) {
-        if (m_Machine->m_IsLimited) Spend(work);
+        if (m_Machine->m_IsLimited) m_Machine->Spend(work);
     }
     // An access to an ordered table walks along its entries.
     void ChargeAccess(const Table* table) {
-        if (m_Machine->m_IsLimited && !table->IsHashed()) Spend(table->CountNodes() / 8);
+        if (m_Machine->m_IsLimited && !table->IsHashed()) m_Machine->Spend(table->CountNodes() / 8);
     }
-    [[noreturn]] void RaiseLimit();
 
     // ---- Levels of calls, as programs count them
     struct Level {
@@ -195,6 +199,7 @@ public:
 
     void GrowStack(int count);
     void ResizeStack(int size);
+    void ShrinkStacks(const Value* end);  // gives back half of what is far too large
     void CloseUpValues(Value* level);
     CallInfo* PushCall() {
         if (++m_Call >= m_CallsEnd) GrowCalls();
@@ -227,7 +232,6 @@ public:
 private:
     void GrowCalls();
     void ResizeCalls(int count);
-    void Spend(size_t work);
     void SetErrorValue(Status status, Value* place);
     Value* UseCallMetamethod(Value* function);
     void ResumeBody(Value* firstArg);

@@ -158,8 +158,8 @@ int StringFormat(State& L) {
             p += 2;
         } else {
             Directive directive;
-            p = ReadDirective(L, p + 1, directive);
             if (++arg > L.GetArgCount()) L.ArgError(arg, "no value");
+            p = ReadDirective(L, p + 1, directive);
             AppendItem(L, result, directive, arg);
         }
     }

@@ -36,14 +36,16 @@ void StringTable::Resize(Machine& machine, size_t chainCount) {
 String* StringTable::Intern(Machine& machine, const char* bytes, size_t length) {
     uint32_t hash = GetHash(bytes, length);
     if (m_ChainCount) {
-        for (Object* o = m_Chains[hash & (m_ChainCount - 1)]; o; o = o->m_Next) {
+        size_t steps = 0;
+        for (Object* o = m_Chains[hash & (m_ChainCount - 1)]; o; o = o->m_Next, steps++) {
             String* string = AsString(o);
             if (string->m_Hash == hash && string->m_Length == length &&
-                memcmp(string->GetText(), bytes, length) == 0) {
+                (length == 0 || memcmp(string->GetText(), bytes, length) == 0)) {
                 machine.Revive(string);
                 return string;
             }
         }
+        if (machine.m_IsLimited) machine.Spend(steps / 16);  // somebody's choice, if it is long
     }
     // Never in the middle of a sweep over the chains: those behind would be swept twice.
     if (m_Count >= m_ChainCount && machine.m_Phase != Machine::Phase::SweepStrings) {

@@ -181,6 +181,14 @@ void MoveNode(Table* table, Node* from, Node* to) {
     from->m_Value = g_Nil;
 }
 
+// Foreign text pays for keys that were chosen so that all stand in one chain.
+void ChargeChain(State& L, const Table* table, const Node* node) {
+    if (!L.GetMachine().m_IsLimited || !table->IsHashed()) return;
+    size_t steps = 0;
+    for (; node->m_Key.m_Next; node += node->m_Key.m_Next) steps++;
+    L.Charge(steps / 16);
+}
+
 // Adds a key that is not there.
 Value* AddKey(State& L, Table* table, const Value& key) {
     Node* node = GetMainNode(table, key);
@@ -193,6 +201,7 @@ Value* AddKey(State& L, Table* table, const Value& key) {
         if (GetMainNode(table, node->m_Key.Get()) != node) {
             MoveNode(table, node, free);
         } else {
+            ChargeChain(L, table, node);
             int32_t next = node->m_Key.m_Next;
             free->m_Key.m_Next = next ? next + static_cast<int32_t>(node - free) : 0;
             node->m_Key.m_Next = static_cast<int32_t>(free - node);

@@ -84,7 +84,10 @@ const Instruction* StoreList(State& L, Instruction i, const Instruction* pc, Val
     int64_t last = (static_cast<int64_t>(block) - 1) * kFieldsPerFlush + count;
     if (last > INT32_MAX) L.RunError("table overflow");
     auto index = static_cast<int>(last);
-    if (index > table->m_ArraySize) ResizeArray(L, table, index);  // all at once
+    // All at once; items far beyond the array come from no constructor, and take no memory for it.
+    if (index > table->m_ArraySize && index - count <= table->m_ArraySize) {
+        ResizeArray(L, table, index);
+    }
     for (; count > 0; count--, index--) {
         *SetSlot(L, table, index) = ra[count];
         L.GetMachine().BarrierBack(table, ra[count]);
@@ -97,7 +100,7 @@ void PrepareFor(State& L, Value* ra) {
     static constexpr const char* kWhat[] = {"initial value", "limit", "step"};
     for (int i = 0; i < 3; i++) {
         double number;
-        if (!State::ToNumber(ra[i], number)) L.RunError("'for' %s must be a number", kWhat[i]);
+        if (!L.ReadNumber(ra[i], number)) L.RunError("'for' %s must be a number", kWhat[i]);
         ra[i] = Value::Number(number);
     }
     ra[0].m_Number -= ra[2].m_Number;
@@ -117,6 +120,7 @@ Value* PushVarargs(State& L, const Prototype* p, int a, int wanted, Value* base)
     if (count < 0) count = 0;
     if (wanted == kAllResults) {
         L.m_Top = L.m_Call->m_Top;
+        L.Charge(static_cast<size_t>(count) / 8);
         L.NeedStack(count);
         base = L.m_Base;
         wanted = count;
@@ -155,7 +159,7 @@ void ReuseFrame(State& L) {
         if constexpr (kIsLimited) {                    \
             if (--L.GetMachine().m_Budget < 0) {       \
                 SAVE;                                  \
-                L.RaiseLimit();                        \
+                L.GetMachine().RaiseLimit();           \
             }                                          \
         }                                              \
         i = *pc++;                                     \

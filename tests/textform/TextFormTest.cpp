@@ -140,6 +140,14 @@ TEST(TextFormLimits, NothingGetsAround) {
         "local t = {} for i = 1, 7000 do t[i] = i end while true do unpack(t) end",
         "local t = {} for i = 1, 20000 do t[i .. ''] = 1 end for k in pairs(t) do t[k] = nil end "
         "while true do next(t) end",
+        "local s = '1' for i = 1, 19 do s = s .. s end while true do local n = s + 0 end",
+        "local s = 'x' for i = 1, 19 do s = s .. s end local a, b = s .. 'a', s .. 'b' "
+        "while true do local less = a < b end",
+        "collectgarbage('setpause', 0) collectgarbage('setstepmul', 0) local t = {} "
+        "for i = 1, 20000 do t[i] = {} end while true do local x = {} end",
+        "while true do collectgarbage('step', 1e6) end",
+        "local function f(...) return f(...) end local t = {} for i = 1, 7000 do t[i] = i end "
+        "f(unpack(t))",
     };
     for (const char* text : tooLong) EXPECT_EQ(RunLimited(text), "! too many instructions") << text;
     const char* const tooMuch[] = {
@@ -160,6 +168,21 @@ TEST(TextFormLimits, NothingGetsAround) {
     }
     EXPECT_EQ(RunLimited("return ('x').len"), "! t:1: attempt to index a string value");
     EXPECT_EQ(RunLimited("local t = {} for i = 1, 1000 do t[i] = i .. '' end return #t"), "1000");
+}
+
+// Keys that were chosen to have one hash, jumps that make one list, names that are sought in many
+// scopes: each step is short, all together would take minutes.
+TEST(TextFormLimits, WorkThatIsNoInstructionCounts) {
+    std::string keys = "return {";
+    for (int i = 0; i < 20000; i++) {  // only every second character counts in the hash of these
+        std::string key(40, 'k');
+        for (int bit = 0; bit < 15; bit++) key[8 + 2 * bit] = i >> bit & 1 ? 'a' : 'b';
+        keys.append("'").append(key).append("',");
+    }
+    EXPECT_EQ(RunLimited(keys + "}"), "! too many instructions");
+    std::string jumps = "return a";
+    for (int i = 0; i < 20000; i++) jumps += " or a";
+    EXPECT_EQ(RunLimited(jumps), "! too many instructions");
 }
 
 TEST(TextFormLimits, TextOfAnySizeFailsInItsOwnWay) {
@@ -191,6 +214,26 @@ TEST(TextFormLimits, MemoryRunsOutAnywhere) {
     EXPECT_GT(failures, 50);
 }
 
+TEST(TextFormLife, StacksGiveMemoryBack) {
+    EXPECT_EQ(
+        RunText("local function deep(n) if n > 0 then return 1 + deep(n - 1) end return 0 end "
+                "collectgarbage() local before = collectgarbage('count') deep(15000) "
+                "for i = 1, 20 do collectgarbage() end "
+                "return collectgarbage('count') - before < 20"),
+        "true");
+}
+
+// The number of the last part of a long list looks like any instruction.
+TEST(TextFormDialect, LongListsBeforeJumps) {
+    for (int count : {26950, 26949, 50 * 535, 50 * 599}) {
+        std::string list = "{";
+        for (int i = 0; i < count; i++) list += "1,";
+        std::string text = "while true do t = " + list;
+        text.append("} break end local u = ").append(list).append("} or 5 return #t + #u");
+        EXPECT_EQ(RunText(text), std::to_string(2 * count));
+    }
+}
+
 TEST(TextFormLife, FinalisersRunWhenItEnds) {
     static int s_Calls;
     s_Calls = 0;
@@ -200,11 +243,13 @@ TEST(TextFormLife, FinalisersRunWhenItEnds) {
         OpenAll(L);
         L.PushFunction([](State&) { return s_Calls++, 0; });
         L.SetField(L.m_Globals, "count", L.m_Top[-1]);
-        EXPECT_EQ(RunText(interpreter,
-                          "local function p(f) local u = newproxy(true) getmetatable(u).__gc = f "
-                          "return u end a = p(count) b = p(function() error('x') end) c = p(count) "
-                          "d = p(function() p(count) end) return 1"),
-                  "1");
+        EXPECT_EQ(
+            RunText(interpreter,
+                    "local function p(f) local u = newproxy(true) getmetatable(u).__gc = f "
+                    "return u end a = p(count) b = p(function() error('x') end) c = p(count) "
+                    "d = p(function() p(count) end) local function more() p(more) error('x') end "
+                    "e = p(more) return 1"),
+            "1");
         EXPECT_EQ(s_Calls, 0);
     }
     EXPECT_GE(s_Calls, 2);
