@@ -21,6 +21,7 @@ set(KORVEL_PUBLIC_HEADERS
     core/OxID.h
     core/OxString.h
     core/RefObject.h
+    core/ScriptText.h
     core/ScriptVal.h
     core/SpinLock.h
     core/TagList.h

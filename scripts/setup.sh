@@ -1,7 +1,7 @@
 # Shared by ./run, ./test and .ci/run, which source it with `root` set: installs packages, builds.
 # Everything here writes to standard error, so that a script's own output stays clean.
 
-run_packages="g++ cmake ninja-build pkg-config libedit-dev libluajit-5.1-dev lua-lpeg-dev libfribidi-dev zlib1g-dev"
+run_packages="g++ cmake ninja-build pkg-config libedit-dev libluajit-5.1-dev lua-lpeg-dev libfribidi-dev zlib1g-dev libcjson-dev"
 test_packages="$run_packages libgtest-dev locales luajit lua5.1 python3-minimal"
 
 # need PACKAGE...: installs those that are missing, in one step.

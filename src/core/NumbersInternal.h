@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <limits>
 
@@ -19,5 +20,14 @@ inline long long ToInt64(double number) {
 inline uint32_t Low32(double number) {
     return static_cast<uint32_t>(ToInt64(number));
 }
+
+// What the texts of numbers need at most.
+constexpr size_t kNumberTextSize = 40;
+
+// Writes a number with 6 or 15 significant digits, byte by byte what printf writes for "%g" and
+// "%.15g" in the "C" locale, but without the NUL. Returns the end of the text; `out` needs
+// kNumberTextSize bytes.
+char* WriteFloat(char* out, double number);
+char* WriteDouble(char* out, double number);
 
 }  // namespace Korvel

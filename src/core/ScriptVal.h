@@ -61,8 +61,17 @@ constexpr uint32_t SVF_FromWire = 0x80000000;     // args: what they cause is pr
 constexpr uint32_t SVF_ForeignCode = 0x100000;    // code: came from another process
 
 // How many tables and args lists may stand one in another where values come from outside or leave
-// for it: in packets, in Lua, in JSON.
+// for it: in packets, in Lua, in text, in JSON.
 constexpr int kMaxNesting = 256;
+
+// How a value is written as text.
+enum TextOptions : unsigned int {
+    TXT_Compact = 1,       // every table on one line
+    TXT_SingleQuotes = 2,  // around strings
+    // Objects, functions and pointers, which else are nil, as what cannot be read back.
+    TXT_References = 4,
+    TXT_Flat = 8,  // a listing without braces and commas, which cannot be read back either
+};
 
 constexpr ScriptValType operator|(ScriptValType type, uint32_t flags) {
     return static_cast<ScriptValType>(static_cast<uint32_t>(type) | flags);
@@ -466,6 +475,52 @@ public:
     // A fresh random UUID as text.
     static ScriptVal CreateUUID();
     static void CreateUUID(ScriptVal& value);
+
+    // The text form (docs/textform.md): a table constructor of Lua with a few forms more, which is
+    // read by running it. `options` are bits of TextOptions. `indent` counts tabs; a negative one
+    // writes none at its level, and each level below has one more. Writing at a level below 1 puts
+    // the process into the "C" locale. The value must not change meanwhile.
+
+    // The bytes of the text, without a NUL; -1 for 2 GiB and more, and for tables that nest deeper
+    // than kMaxNesting.
+    int ToTextLen(int indent, unsigned int options) const;
+    // Writes the text and a NUL to a buffer of ToTextLen + 1 bytes, which must not have been -1.
+    // Returns where the NUL is.
+    char* ToText(char* buffer, int indent, unsigned int options) const;
+    // False, with `out` empty, where there is no length, and without memory.
+    bool ToText(OxStringT<char>& out, int indent, unsigned int options) const;
+    // Writes the text to a file, in place of what that holds. False, and the file untouched, as
+    // above; also when it cannot be opened, or not all of it could be written.
+    bool Save(const char* file, unsigned int options) const;
+
+    // The readers run the text as a program of the own process: they are not for text that others
+    // can write. The value is nil when they fail, and they read functions as code.
+    //   err      may be null; else room for `errlen` bytes, which take the message of a failure. On
+    //            entry it may hold the name of the text for messages. After a success it is empty,
+    //            or holds the text of a string or number that was read.
+    //   options  is not used
+
+    // Reads a file. One that cannot be read leaves the value and `err` as they are.
+    bool Load(const char* file, char* err, int errlen, unsigned int options);
+    // Reads an expression; unknown names in it become constructors.
+    bool FromText(const char* text);
+    // Reads an expression behind `prefix`: GetSerializePrologue(), or another text that ends in
+    // "return "; null is just that. With `freeText` the text comes from malloc, and is freed.
+    bool FromText(const char* text, const char* prefix, char* err, int errlen, bool freeText,
+                  unsigned int options);
+    // Runs statements and reads the global variable, or field ("a.b"), of that name.
+    bool FromTextByName(const char* text, const char* name, char* err, int errlen, bool freeText,
+                        unsigned int options);
+
+    // JSON. A table with an entry at number key 1 is an array of all its values, any other one an
+    // object of what stands under text keys. A number that JSON does not have becomes null, and
+    // what is no nil, number, text, boolean or table is left out. False, with `out` unchanged, for
+    // what is left out as a whole, for nesting deeper than kMaxNesting, and without memory.
+    bool ToJSON(OxStringT<char>& out) const;
+    // False, with the value unchanged, for what is no JSON or nests too deeply, for texts with a
+    // NUL or with byte 0xFF in front, for a read-only value, and without memory. A number that is
+    // too large becomes nil.
+    bool FromJSON(const OxStringT<char>& text);
 
     // The wire form (docs/protocol.md). Objects are counted on the connection. Without one they
     // come in as nil, and without one that is open they go out without a number. Defined with the

@@ -191,9 +191,10 @@ void DumpPacket(const Packet* packet, const RemoteApp* app, const char* directio
 }
 
 void TraceValues(const char* arrow, uint32_t context, const ScriptVal& values) {
+    OxStringT<char> text;
+    if (!values.ToText(text, 0, TXT_Compact | TXT_References)) text = "(no text)";
     Platform::NoKill noKill;
-    printf("   %s [%u] ", arrow, context);
-    values.Dump();
+    printf("   %s [%u] %s\n", arrow, context, static_cast<const char*>(text));
 }
 
 }  // namespace Korvel

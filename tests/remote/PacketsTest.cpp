@@ -395,7 +395,7 @@ TEST(Packets, DeferredRepliesAndTraces) {
     packet->m_Type = 11;
     DumpPacket(packet.get(), nullptr, "Recv");
     EXPECT_EQ(testing::internal::GetCapturedStdout(),
-              "   <- [6] Table\n{\n  -1 = 5\n}\n"
+              "   <- [6] { [-1] = 5 }\n"
               "App (nil): Send ctx=6 tgt=0 PKT_Reply \n"
               "App (nil): Recv ctx=12 tgt=3 PKT_Script SST_Sub \n"
               "App (nil): Recv ctx=12 tgt=3 PKT_????? \n");

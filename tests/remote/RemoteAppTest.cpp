@@ -315,8 +315,8 @@ TEST_P(RemoteAppTest, TracesWhatACallCauses) {
     snprintf(expected, sizeof expected,
              "App %p: Send ctx=1 tgt=1 PKT_Script SST_Call \n"
              "App %p: Recv ctx=1 tgt=1 PKT_Script SST_Call \n"
-             "   -> [1] Table\n{\n  1 = \"text\"\n}\n"
-             "   <- [1] Table\n{\n  -1 = \"text\"\n}\n"
+             "   -> [1] { \"text\" }\n"
+             "   <- [1] { [-1] = \"text\" }\n"
              "App %p: Send ctx=1 tgt=0 PKT_Reply \n"
              "App %p: Recv ctx=1 tgt=0 PKT_Reply \n",
              static_cast<void*>(m_Near), static_cast<void*>(m_Far), static_cast<void*>(m_Far),
@@ -535,7 +535,7 @@ TEST(RemoteAppPeer, ServesAnIndependentPeer) {
         EXPECT_TRUE(result[-2].IsRemoteObject());
     });
     ProcessResult result =
-        RunProcess({"/usr/bin/python3", PEER_SCRIPT, std::to_string(listener.m_Port)});
+        RunProcess({"/usr/bin/python3", PEER_SCRIPT, "objects", std::to_string(listener.m_Port)});
     accept.join();
     EXPECT_EQ(result.m_Out + result.m_Err, "ok\n");
     EXPECT_TRUE(WaitUntil([&] { return !app->Connected(); }));
