@@ -3,6 +3,7 @@
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <limits.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstdlib>
@@ -53,8 +54,21 @@ FILE* fdopen(int fd, const char* mode) {
     return file;
 }
 
+bool GetAppFileName(char* buf, int size) {
+    if (!buf || size <= 0) return false;
+    ssize_t length = readlink("/proc/self/exe", buf, static_cast<size_t>(size));
+    if (length <= 0 || length == size) return false;
+    buf[length] = 0;
+    return true;
+}
+
 int GetSystemFolder(SysFolder folder, char* buf, int size) {
     if (!buf) return kMaxPath;
+    if (folder == SF_Program) {
+        if (!GetAppFileName(buf, size)) return 0;
+        strrchr(buf, '/')[1] = 0;
+        return kMaxPath;
+    }
     long length = folder == SF_Library ? s_LibraryFolder.m_Length : 0;
     if (length == 0 || length >= size) return 0;
     memcpy(buf, s_LibraryFolder.m_Path, static_cast<size_t>(length));

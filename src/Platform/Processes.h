@@ -25,6 +25,36 @@ KORVEL_EXPORT bool GetEnv(const char* name, OxStringT<char>& value);
 // empty text and when memory has run out. To tell the settings of EnvVar, call InvalidateEnv.
 KORVEL_EXPORT bool PutEnv(const char* setting);
 
+// Another process, as a handle: its id, widened. It owns nothing.
+struct _Process;
+
+// Starts a program with this process's environment and its three standard streams. The caller waits
+// for it, or it stays behind when it has ended.
+//   commandLine  the program and its arguments, cut at blanks: each blank ends an argument, even an
+//                empty one. From a double quote to the next one blanks are text, and the second one
+//                ends the argument and takes a blank behind it along. A first one is left out where
+//                it begins an argument; elsewhere it is text.
+//   folder       the working directory of the program, whose name is then a path from there. With
+//                null it is this process's own; a name without a slash is also looked for in PATH
+//   flags        not used
+//   idOut        takes the id; may be null
+//   returns      null, with errno set, when it cannot be started
+KORVEL_EXPORT _Process* NewProcess(const char* commandLine, const char* folder, unsigned int flags,
+                                   unsigned long long* idOut);
+// Waits for the end of a child, without a limit, and gives its exit status; 0 when a signal has
+// ended it, 0xFFFFFFFF for null and for what is no child.
+KORVEL_EXPORT unsigned int WaitProcess(_Process* process, unsigned int timeoutMs);
+KORVEL_EXPORT void DeleteProcess(_Process* process);  // nothing: it goes on
+
+KORVEL_EXPORT unsigned long long GetCurrentProcessID();
+KORVEL_EXPORT _Process* GetCurrentProcess();
+KORVEL_EXPORT unsigned long long GetProcessID(_Process* process);
+
+// The first process of a name, of which the system keeps 15 bytes; 0 when there is none.
+KORVEL_EXPORT unsigned long long FindProcessID(const char* name);
+// Kills a process. False for 0 and when it may not, or there is none.
+KORVEL_EXPORT bool TerminateProcessID(unsigned long long id);
+
 // A fresh random UUID as 36 characters of lower-case text, in a block of 40 bytes of the C heap
 // that DeleteUUID frees. Null when there is no memory or no randomness.
 KORVEL_EXPORT char* NewUUID();
