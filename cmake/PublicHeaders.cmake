@@ -34,12 +34,14 @@ set(KORVEL_PUBLIC_HEADERS
     objects/ScriptConfig.h
     objects/ScriptObject.h
     objects/ScriptSymbol.h
+    remote/AcceptedApp.h
     remote/ConnectApp.h
     remote/Packets.h
     remote/RemoteApp.h
     remote/RemoteObject.h
     remote/ScriptApp.h
     remote/ScriptPort.h
+    remote/ScriptServer.h
     runtime/Script.h
     runtime/ScriptDebug.h
     runtime/ScriptLanguage.h

@@ -32,7 +32,7 @@ constexpr uint32_t SCF_LocalOnly = 4;  // uses the script server of this machine
 struct ScriptConfig {
     using UIFunction = unsigned long long (*)(void* a, void* b);
 
-    uint32_t m_Version = 1;
+    uint32_t m_Version = 2;  // 1 for a record that ends with Setup
     uint32_t m_Flags = SCF_Standard;
     const char* m_AppName = nullptr;    // as peers and the script server see it
     void* m_UserData = nullptr;         // passed to the callbacks
@@ -56,10 +56,24 @@ struct ScriptConfig {
     // A script state comes or goes.
     void (*Setup)(KorvelScript::ScriptState* state, KorvelScript::eSCSetupState stage,
                   void* userData, TagList* tags) = nullptr;
+
+    // From version 2 on
+
+    // Whether a peer may use this process, on the thread of the peer's call: the UI thread, where
+    // there is one. Until it has said yes once, the peer can introduce itself and log in, and
+    // nothing else; but one that this process has called, whoever that turned out to be, can use
+    // the objects that it has been given, and a script server can ask for GetPingInfo. Both texts
+    // are as the peer sent them, empty for none. Null lets everybody in. Never asked within the
+    // process.
+    bool (*Login)(void* userData, RemoteApp* app, const char* user, const char* password,
+                  TagList* tags) = nullptr;
+
+    bool WantsLogin() const { return m_Version >= 2 && Login; }
 };
 
 static_assert(offsetof(ScriptConfig, m_AppName) == 8 && offsetof(ScriptConfig, m_Active) == 24 &&
-              offsetof(ScriptConfig, IsDebugMode) == 32 && sizeof(ScriptConfig) == 104);
+              offsetof(ScriptConfig, IsDebugMode) == 32 && offsetof(ScriptConfig, Login) == 104 &&
+              sizeof(ScriptConfig) == 112);
 
 // The installed configuration, borrowed from the host; null when there is none.
 KORVEL_EXPORT extern std::atomic<ScriptConfig*> g_ScriptConfig;

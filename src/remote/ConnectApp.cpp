@@ -16,7 +16,7 @@ ConnectApp* ConnectApp::New() {
 
 void ConnectApp::AppThreadFunc() {
     Use();
-    RemoteApp::AppThreadFunc();
+    AcceptedApp::AppThreadFunc();
     SetRoot(ScriptVal());
     Recycle();
 }

@@ -1,15 +1,15 @@
 #pragma once
 
-#include "remote/RemoteApp.h"
+#include "remote/AcceptedApp.h"
 
 namespace Korvel {
 
 // A connection that somebody else has asked for. It keeps the peer's application object for as long
 // as it runs, or until the peer holds nothing of this process any more: so it needs no owner, and
 // closes by itself when it serves nobody.
-class KORVEL_EXPORT ConnectApp : public RemoteApp {
+class KORVEL_EXPORT ConnectApp : public AcceptedApp {
 public:
-    ConnectApp(const char* name, unsigned int ip) : RemoteApp(name, ip, nullptr) {}
+    ConnectApp(const char* name, unsigned int ip) : AcceptedApp(name, ip) {}
     ~ConnectApp() override;
 
     // One that has its root, to be connected; the caller's, who calls SetRoot(nil) when that fails.

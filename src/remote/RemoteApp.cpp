@@ -350,9 +350,10 @@ void RemoteApp::SetConnectionInfo(ScriptVal& args) {
 }
 
 void RemoteApp::SetPeer(const char* name, const char* hostName, unsigned int ip,
-                        const ScriptVal& uuid) {
+                        const ScriptVal& uuid, const char* subtype) {
     AutoAppLock guard(m_Lock);
     m_Name = CutName(name);
+    m_Subtype = CutName(subtype);
     m_HostName = CutName(hostName);
     m_IP = ip;
     m_UUID = uuid;

@@ -19,6 +19,8 @@ namespace Korvel {
 
 class Packet;
 class ScriptInfo;
+template <class T>
+class ptr;
 struct ObjectRecord;
 struct Request;
 
@@ -63,13 +65,15 @@ public:
     virtual bool Connect(Platform::_Socket* socket);
     // Connects by address (in network order) and port, within the process where that is its own,
     // and shakes hands; ends what was connected before. False, and not connected, when nobody is
-    // there or answers in time, when the peer refuses, and when its UUID is not the one that this
-    // connection has. Without one it takes the peer's. ScriptApp.h tells of `reply`.
+    // there or answers in time, when the peer refuses, when its UUID is not the one that this
+    // connection has, while another thread connects it, and when that is cancelled. Without a UUID
+    // it takes the peer's. It can be tried again. ScriptApp.h tells of `reply`.
     virtual bool Connect(unsigned int ip, unsigned int port, ScriptVal& reply);
 
-    // Ends the connection and waits for its thread to do its last step, in milliseconds; 0xFFFFFFFF
-    // has no limit. On that thread itself it does not wait. False when it was not connected, when
-    // the thread has not ended in time, and where the UI thread would wait for itself.
+    // Sends what is queued, for a second at most, ends the connection and waits for its thread to
+    // do its last step, in milliseconds; 0xFFFFFFFF has no limit. On that thread itself it does not
+    // wait. False when it was not connected, when the thread has not ended in time, and where the
+    // UI thread would wait for itself.
     virtual bool _Disconnect(unsigned int waitMs);
     virtual void AppThreadFunc();  // the body of the thread
 
@@ -121,8 +125,14 @@ public:
     virtual void DoWrite();
     virtual void DispatchPacket(Packet* packet);
 
+    // Connects by what this connection has been made for: asks the script server at the host name
+    // for the port of the application with the name, subtype and UUID, then connects by address.
+    // Without a name, it connects to the script server itself. False as there, and when the server
+    // is not there or knows no such application.
     virtual bool Connect(ScriptVal& reply);
     virtual bool Connect();
+    // The same on a thread of its own. The host hears of it by OnConnect or OnConnectFailed. False,
+    // with nothing done, when there is no thread, and while another thread connects it.
     virtual bool AsyncConnect();
 
     virtual bool Connected() const;
@@ -202,8 +212,25 @@ public:
     // Nothing at all once another run has begun.
     void Refuse(uint16_t run);
 
+    // Whether the peer need not log in, or has done so, see ScriptConfig::Login. A host lets one in
+    // that it has called and trusts.
+    bool IsLoggedIn() const;
+    void SetLoggedIn(uint16_t run);  // the peer of a run; nothing once another one has begun
+
+    // Makes the attempt of another thread to connect this connection fail soon. It goes on for as
+    // long as name servers take.
+    void CancelConnect();
+
     // The peer's name and UUID, from keys 1 and 2. What it claims, cut to what there is room for.
     void SetConnectionInfo(ScriptVal& args);
+
+    // What of a peer's text may stand in a log or on a terminal: at most 127 bytes, no control
+    // characters.
+    static OxStringT<char> CutName(const char* name);
+
+    // Whether the peer runs on this machine, which no name server is asked for. False when not
+    // connected.
+    bool IsPeerLocal() const;
 
     // Whether an address is this machine's: 127.0.0.1, or one that leads to this machine's name. It
     // may wait for name servers.
@@ -219,7 +246,12 @@ protected:
     // A proxy of the peer's application object, connected or not. Nil without memory.
     ScriptVal GetRoot();
     // What is known of the peer. Texts are cut to what there is room for.
-    void SetPeer(const char* name, const char* hostName, unsigned int ip, const ScriptVal& uuid);
+    void SetPeer(const char* name, const char* hostName, unsigned int ip, const ScriptVal& uuid,
+                 const char* subtype = nullptr);
+
+    void Enlist();  // on g_AppList
+    // One more use, unless the last one has gone.
+    bool UseIfHeld() const;
 
     // Tells the host that the connection is made, and from then on of its end, too.
     void ReportConnect();
@@ -245,20 +277,38 @@ private:
                                double timeOut);
     friend ScriptVal ScriptApp(RemoteApp* app, Platform::_Socket* socket, const char* name,
                                ScriptVal uuid);
+    friend ScriptVal ScriptApp(const char* name, const char* subtype, ScriptVal uuid,
+                               const char* host, double timeOut);
+    friend ScriptVal AsyncScriptApp(const char* name, const char* subtype, ScriptVal uuid,
+                                    const char* host, double timeOut, bool connect);
     friend void ForEachApp(void (*visit)(void* data, RemoteApp& app), void* data);
 
-    // Connecting
-    bool ConnectThere(unsigned int ip, unsigned int port);
+    // Connecting. One thread at a time has the turn, which the functions without a comment need.
+    class ConnectTurn;
+    bool BeginConnecting();  // takes the turn
+    void EndConnecting();
+    bool ConnectByName(ScriptVal& reply);
+    bool ConnectByName(unsigned int ip, ScriptVal& reply);
+    bool ConnectToServer(unsigned int ip);
+    bool FindHost(unsigned int ip, ScriptVal& info);
+    ScriptVal AskServer(ScriptVal& root);
+    bool ConnectByAddress(unsigned int ip, unsigned int port, ScriptVal& reply);
+    enum class PeerKind : uint8_t { Caller, Host, Server };  // the latter two called from here
+    bool ConnectThere(unsigned int ip, unsigned int port, PeerKind kind);
+    Platform::_Socket* DoConnectSock(unsigned int port, unsigned int ip, double timeOut);
+    bool AwaitAnswer(Platform::_Socket* socket, double timeOut);
     bool ConnectHere();
     bool ShakeHands(ScriptVal& root, ScriptVal& reply);
-    static OxStringT<char> CutName(const char* name);
+    // One that is listed, to be connected by name.
+    static ptr<RemoteApp> NewByName(const char* name, const char* subtype, const ScriptVal& uuid,
+                                    const char* host, double timeOut);
+    void EndAsyncConnect(bool isConnected);
 
     // On g_AppList
-    void Enlist();
     void Delist();
-    bool UseIfHeld() const;
 
     // A run
+    bool ConnectOver(Platform::_Socket* socket, PeerKind kind);
     bool BeginRun();
     bool StartThread(Platform::_Socket* socket, RemoteApp* peer);
     bool PrepareLocked(Platform::_Socket* socket);
@@ -281,6 +331,7 @@ private:
     void ReportEnd();
     bool SetReported(bool isReported);
     static unsigned long long TellConnect(void* app, void* run);
+    static unsigned long long TellConnectFailed(void* app, void* run);
     static unsigned long long TellEnd(void* app, void* run);
 
     // Any thread
@@ -298,6 +349,7 @@ private:
     void Sleep();
     unsigned int GetSleepMs();
     bool Serve();
+    void StopSending();
     bool WriteSome();
     bool ReadSocket();
     bool TakeInput();
@@ -321,6 +373,10 @@ private:
     void ReplyError(Packet* request, ScriptError code, const char* text = nullptr);
     void CallMember(Packet* packet);
     void CallMember(Packet* packet, ScriptObject* object, ScriptInfo* info);
+    bool MayUseGiven() const;
+    bool MayUse(uint32_t target) const;
+    bool IsOpenToAll(uint32_t opcode, const ScriptArgs& args) const;
+    bool RefuseStranger(Packet* packet, bool isKnown);
     void CountReference(Packet* packet);
     void GetInfo(Packet* packet);
     void TakeStateData(Packet* packet);
@@ -370,6 +426,7 @@ private:
     uint32_t m_RemoteCount = 0;  // proxies in use
     ScriptVal m_UUID;
     OxStringT<char> m_Name;
+    OxStringT<char> m_Subtype;  // that the script server is asked for
     OxStringT<char> m_HostName;
     unsigned int m_IP = 0;
     double m_TimeOut = 0;
@@ -381,7 +438,10 @@ private:
     ScriptVal m_Data;  // guarded by m_DataLock
 };
 
-// Open connections of the process.
+// Open connections of the process. Each counts until it asks the host's configuration no more.
 KORVEL_EXPORT unsigned int GetNumConnections();
+
+// Whether there has ever been one.
+KORVEL_EXPORT extern std::atomic<bool> g_HasBeenConnected;
 
 }  // namespace Korvel

@@ -7,6 +7,7 @@
 #include "objects/ScriptObject.h"
 #include "objects/ScriptSymbol.h"
 #include "remote/RemoteApp.h"
+#include "remote/ScriptPortInternal.h"
 #include "remote/TrafficInternal.h"
 
 namespace Korvel {
@@ -32,7 +33,43 @@ bool MayNameOurs(const Packet& packet) {
     return memchr(packet.Payload(), SV_RemoteObject, packet.m_Size - sizeof(Packet));
 }
 
+bool HasArguments(const ScriptArgs& args) {
+    for (TableEntry* entry = nullptr; args.NextKey(entry);) {
+        if (entry->m_Key != 0 && !entry->m_Value.IsNil()) return true;
+    }
+    return false;
+}
+
+// What script servers ask hosts of their own accord. All else is what others have them ask.
+bool IsOfServers(uint32_t opcode, const ScriptArgs& args) {
+    return opcode == SST_CallMemberFunction && args[0] == "GetPingInfo" && !HasArguments(args);
+}
+
+// Whether a call of the application's object is one by which a peer introduces itself or logs in:
+// by its name, the look-up of that, or what the look-up gives.
+bool IsOfStrangers(uint32_t opcode, const ScriptArgs& args) {
+    const ScriptVal& key = args[0];
+    switch (opcode) {
+        case SST_GetTable:
+        case SST_CallMemberFunction:
+            return IsHostMember(key.ToString(""));
+        case SST_CallFunction:
+            return key.IsFunction() && IsHostMember(key.ToFunction());
+        default:
+            return false;
+    }
+}
+
 }  // namespace
+
+bool RemoteApp::IsLoggedIn() const {
+    return m_Traffic->m_IsLoggedIn;
+}
+
+void RemoteApp::SetLoggedIn(uint16_t run) {
+    AutoAppLock guard(m_Lock);
+    if (m_Traffic->m_Run == run) m_Traffic->m_IsLoggedIn = true;
+}
 
 void RemoteApp::Reply(Packet* request, const ScriptVal* second, uint32_t target) {
     auto run = static_cast<uint16_t>(request->m_Reserved);
@@ -48,8 +85,34 @@ void RemoteApp::ReplyError(Packet* request, ScriptError code, const char* text) 
     Reply(request, &error);
 }
 
+// Whether the peer may use what it has been given: it has logged in, or this process has called it.
+bool RemoteApp::MayUseGiven() const {
+    return m_Traffic->m_IsLoggedIn || m_Traffic->m_PeerKind == PeerKind::Host;
+}
+
+// The same for the object with a number: the application's own is not given, but there for all.
+bool RemoteApp::MayUse(uint32_t target) const {
+    return m_Traffic->m_IsLoggedIn || (target != kRootID && MayUseGiven());
+}
+
+// Whether the peer may make a call of the application's object although it may not use that.
+bool RemoteApp::IsOpenToAll(uint32_t opcode, const ScriptArgs& args) const {
+    return IsOfStrangers(opcode, args) ||
+           (m_Traffic->m_PeerKind == PeerKind::Server && IsOfServers(opcode, args));
+}
+
+// True, with the request answered, when the peer may not ask for such a thing: it has not logged
+// in.
+bool RemoteApp::RefuseStranger(Packet* packet, bool isKnown) {
+    if (isKnown) return false;
+    ReplyError(packet, SCERR_NotLoggedIn);
+    Drop(packet);
+    return true;
+}
+
 // Runs what a PKT_Script asks for.
 void RemoteApp::CallMember(Packet* packet) {
+    if (RefuseStranger(packet, packet->m_Target == kRootID || MayUse(packet->m_Target))) return;
     if (!packet->m_Target || !packet->m_Symbol) {
         ReplyError(packet, SCERR_Unknown, "No object/symbol id specified.");
         return Drop(packet);
@@ -69,6 +132,9 @@ void RemoteApp::CallMember(Packet* packet, ScriptObject* object, ScriptInfo* inf
     uint16_t run = static_cast<uint16_t>(packet->m_Reserved);
     ScriptArgs args;
     if (!ScriptVal::FromPacket(this, packet, nullptr, &args)) return Close(kNoValues, run);
+    bool isKnown =
+        MayUse(packet->m_Target) || (args.IsArgs() && IsOpenToAll(packet->m_Symbol, args));
+    if (!isKnown) return ReplyError(packet, SCERR_NotLoggedIn);
     if (!args.IsArgs()) return ReplyError(packet, SCERR_InvalidArgs);
     UnlinkReserved(args);
     args.SetApp(this);
@@ -197,15 +263,16 @@ void RemoteApp::HandleRequest(Packet* packet) {
             Drop(packet);
             break;
         case PKT_GetObjectInfo:
-            GetInfo(packet);
+            if (!RefuseStranger(packet, MayUse(packet->m_Target))) GetInfo(packet);
             break;
         case PKT_LocalToRemote:
+            if (RefuseStranger(packet, m_Traffic->m_IsLoggedIn)) break;
             Reply(packet, nullptr,
                   ExportAddress(packet->m_Symbol | static_cast<uint64_t>(packet->m_Target) << 32));
             Drop(packet);
             break;
         case PKT_SetStateData:
-            TakeStateData(packet);
+            if (!RefuseStranger(packet, MayUseGiven())) TakeStateData(packet);
             break;
         default:
             ReplyError(packet, SCERR_UnknownPacket);

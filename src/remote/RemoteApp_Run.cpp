@@ -1,6 +1,7 @@
 // The runs of a connection: how one begins and ends, who waits for that, and what the host hears of
 // it. The object can run again and again; what belongs to a run carries its number.
 #include <algorithm>
+#include <cstdio>
 #include <utility>
 
 #include "Platform/Events.h"
@@ -20,12 +21,14 @@ namespace {
 
 EnvInt s_PeerTimeoutSeconds("KORVEL_PeerTimeoutSeconds", true, 90);
 
-std::atomic<unsigned int> s_NumConnections{0};
+constinit std::atomic<unsigned int> s_NumConnections{0};
 
 // The connection whose thread this is.
 constinit thread_local RemoteApp* t_Connection = nullptr;
 
 }  // namespace
+
+constinit std::atomic<bool> g_HasBeenConnected{false};
 
 unsigned int GetNumConnections() {
     return s_NumConnections;
@@ -37,6 +40,10 @@ PeerTimeout::PeerTimeout()
 // Beginning
 
 bool RemoteApp::Connect(Platform::_Socket* socket) {
+    return ConnectOver(socket, PeerKind::Caller);
+}
+
+bool RemoteApp::ConnectOver(Platform::_Socket* socket, PeerKind kind) {
     if (!IsConnectionThread()) _Disconnect(Platform::kNoTimeLimit);
     if (BeginRun()) {
         Platform::SetSocketNonBlocking(socket, true);
@@ -44,7 +51,12 @@ bool RemoteApp::Connect(Platform::_Socket* socket) {
         PeerTimeout timeout;
         Platform::SetSocketKeepAlive(socket, timeout.AskAfter(), timeout.AskEvery(),
                                      PeerTimeout::kNumQuestions);
+        ScriptConfig* config = g_ScriptConfig.load(std::memory_order_acquire);
+        m_Traffic->m_PeerKind = kind;
+        m_Traffic->m_IsLoggedIn = !config || !config->WantsLogin();
+        uint16_t run = GetRun();
         if (StartThread(socket, nullptr)) return true;
+        Cleanup(run);
     }
     Platform::DeleteSocket(socket);
     return false;
@@ -100,13 +112,14 @@ bool RemoteApp::BeginRun() {
         if (++traffic.m_Run == 0) traffic.m_Run = 1;
         traffic.m_MustQuit = traffic.m_WantsEnd = traffic.m_HasEnded = false;
         traffic.m_IsServing = traffic.m_HasInput = traffic.m_IsRefused = false;
+        traffic.m_IsLoggedIn = true;
         traffic.m_WhyClosed = nullptr;
         traffic.m_NumSilent = traffic.m_NumUnanswered = 0;
         traffic.m_HeldUntilNs = 0;
         traffic.m_NextDeadlineNs = INT64_MAX;
         traffic.m_QuitLimitNs = traffic.m_OwedSinceNs = 0;
         traffic.m_NextCheckNs = traffic.m_ProgressNs = NowNs();
-        traffic.m_HasWritten = false;
+        traffic.m_HasWritten = traffic.m_IsShut = false;
         traffic.m_Threshold = 1;
         traffic.m_NumInput = traffic.m_NumUsed = traffic.m_NumWritten = traffic.m_NumRead = 0;
     }
@@ -114,7 +127,7 @@ bool RemoteApp::BeginRun() {
     return true;
 }
 
-// False, and it does not run, without a thread, descriptors or memory.
+// False, and it does not run, without a thread, descriptors or memory, and when it shall not be.
 bool RemoteApp::StartThread(Platform::_Socket* socket, RemoteApp* peer) {
     auto start = [](void* pointer) -> unsigned long long {
         auto* app = static_cast<RemoteApp*>(pointer);
@@ -128,7 +141,7 @@ bool RemoteApp::StartThread(Platform::_Socket* socket, RemoteApp* peer) {
     Traffic& traffic = *m_Traffic;
     traffic.m_IsBeginning = false;
     Platform::_Thread* thread = nullptr;
-    if (PrepareLocked(socket)) {
+    if (!traffic.m_IsCancelled && PrepareLocked(socket)) {
         Use();
         thread = Platform::NewThread(start, this, 0, nullptr);
         if (!thread) Recycle();
@@ -144,6 +157,13 @@ bool RemoteApp::StartThread(Platform::_Socket* socket, RemoteApp* peer) {
     traffic.m_HasThread = true;
     traffic.m_IsRunning = true;
     s_NumConnections++;
+    g_HasBeenConnected = true;  // behind the count: who sees no connection knows one has gone
+    if (m_Flags & PKF_Trace) {
+        Platform::NoKill noKill;
+        printf("App %p. %lld: Connected to socket %lld\n", static_cast<const void*>(this),
+               static_cast<long long>(m_AppID),
+               static_cast<long long>(reinterpret_cast<intptr_t>(socket)));
+    }
     return true;
 }
 
@@ -338,13 +358,13 @@ void RemoteApp::CloseDown() {
         std::swap(m_StateData, stateData);
         traffic.m_IsRunning = false;
     }
-    bool wasLast = --s_NumConnections == 0;
     if (socket != kInProcess) Platform::DeleteSocket(socket);
     LeavePeer();
     ReportEnd();
     stateData = SV_Nil;
     DropRequests(requests);
-    if (wasLast) FreeSparePackets();
+    // Who sees no connection may take the configuration away.
+    if (--s_NumConnections == 0) FreeSparePackets();
 }
 
 // Telling the host
@@ -395,6 +415,13 @@ unsigned long long RemoteApp::TellConnect(void* appPointer, void* run) {
     auto* app = static_cast<RemoteApp*>(appPointer);
     bool isCurrent = app->IsRun(static_cast<uint16_t>(reinterpret_cast<uintptr_t>(run)));
     if (isCurrent && app->SetReported(true)) TellHost(&ScriptConfig::OnConnect, app);
+    app->Recycle();
+    return 0;
+}
+
+unsigned long long RemoteApp::TellConnectFailed(void* appPointer, void*) {
+    auto* app = static_cast<RemoteApp*>(appPointer);
+    TellHost(&ScriptConfig::OnConnectFailed, app);
     app->Recycle();
     return 0;
 }

@@ -19,7 +19,7 @@ namespace {
 constexpr unsigned int kSocketEvents = Platform::SE_READ | Platform::SE_CLOSE;
 constexpr unsigned int kMaxSleepMs = 1000;
 constexpr int64_t kMaxDelayMs = 10000;
-constexpr int64_t kQuitLimitNs = 1000 * kNsPerMs;  // that the peer has after our end of sending
+constexpr int64_t kQuitLimitNs = 1000 * kNsPerMs;  // from _Disconnect on
 constexpr int kStepsInARow = 16;                   // before something else has its turn
 constexpr uint32_t kFirstCapacity = 262144;        // of a large packet that has only begun
 constexpr uint32_t kMostThreshold = 131072;        // of bytes to wait for
@@ -75,17 +75,17 @@ void RemoteApp::Sleep() {
 // One round; false at the end of the connection.
 bool RemoteApp::Serve() {
     Traffic& traffic = *m_Traffic;
+    int64_t now = NowNs();
     if (traffic.m_MustQuit && !traffic.m_QuitLimitNs) {
         if (!traffic.m_SocketEntry) return false;
-        Platform::ShutdownSocket(traffic.m_Socket, 2);
-        traffic.m_QuitLimitNs = NowNs() + kQuitLimitNs;
+        traffic.m_QuitLimitNs = now + kQuitLimitNs;
     }
-    int64_t now = NowNs();
     if (traffic.m_QuitLimitNs && now >= traffic.m_QuitLimitNs) return false;
     if (traffic.m_SocketEntry) {
         // A wake-up hides what the socket has to say, and an error has no event of its own: so
         // there is always a look.
         DoWrite();
+        if (traffic.m_QuitLimitNs) StopSending();
         DoRead();
         DoWrite();
     } else {
@@ -94,6 +94,14 @@ bool RemoteApp::Serve() {
     EndOverdue(now);
     if (traffic.m_SocketEntry && now >= traffic.m_NextCheckNs) CheckPeer(now);
     return !traffic.m_HasEnded && !traffic.m_WhyClosed && !IsIdle();
+}
+
+// When what was to be sent has been, or has a delay: the peer then sees the end.
+void RemoteApp::StopSending() {
+    Traffic& traffic = *m_Traffic;
+    if (traffic.m_IsShut || traffic.m_Writing) return;
+    Platform::ShutdownSocket(traffic.m_Socket, 2);
+    traffic.m_IsShut = true;
 }
 
 // Disconnect has been called, and nothing is under way.
@@ -138,7 +146,7 @@ Packet* RemoteApp::TakeFor(const RemoteApp* peer, bool mayWait) {
 // A packet with another one behind it waits in the system for that, so that both travel together.
 void RemoteApp::DoWrite() {
     Traffic& traffic = *m_Traffic;
-    for (int i = 0; !traffic.m_QuitLimitNs; i++) {
+    for (int i = 0; !traffic.m_IsShut; i++) {
         if (!traffic.m_Writing) traffic.m_Writing = GetNextSendPacket();
         if (!traffic.m_Writing) break;
         if (i == kStepsInARow) {
@@ -150,7 +158,7 @@ void RemoteApp::DoWrite() {
     }
     // An error shows when reading. Once it is shut, a socket is ready for writing all the time.
     unsigned int events = kSocketEvents;
-    if (traffic.m_Writing && !traffic.m_QuitLimitNs) events |= Platform::SE_WRITE;
+    if (traffic.m_Writing && !traffic.m_IsShut) events |= Platform::SE_WRITE;
     Platform::ModifySocketSetEvents(traffic.m_Set, traffic.m_SocketEntry, events);
 }
 

@@ -1,12 +1,24 @@
 #include "remote/ScriptApp.h"
 
+#include <cstring>
+#include <memory>
 #include <vector>
 
 #include "Platform/Networking.h"
 #include "core/RefObject.h"
+#include "diag/Env.h"
 #include "remote/RemoteApp.h"
+#include "remote/ScriptPort.h"
 
 namespace Korvel {
+namespace {
+
+EnvBool s_ConnectLock("KORVEL_ConnectLock", true, true);
+EnvBool s_EarlyConnectLock("KORVEL_EarlyConnectLock", true, true);
+
+constexpr double kLoginTimeOut = 5;  // in seconds
+
+}  // namespace
 
 // Never destroyed: connections may be let go of by static objects of hosts.
 KorvelScript::Lock& g_AppLock = *new KorvelScript::Lock;
@@ -45,6 +57,47 @@ void ForEachApp(void (*visit)(void* data, RemoteApp& app), void* data) {
         }
     }
     for (const ptr<RemoteApp>& app : held) visit(data, *app);
+}
+
+ptr<RemoteApp> RemoteApp::NewByName(const char* name, const char* subtype, const ScriptVal& uuid,
+                                    const char* host, double timeOut) {
+    ptr<RemoteApp> app(new RemoteApp("", 0, nullptr));
+    app->SetPeer(name, host, 0, uuid.IsString() ? uuid : ScriptVal(), subtype);
+    app->SetTimeOut(timeOut);
+    app->Enlist();
+    return app;
+}
+
+ScriptVal ScriptApp(const char* name, const char* subtype, ScriptVal uuid, const char* host,
+                    double timeOut) {
+    bool mustWait = name && *name != '!';
+    if (name && !mustWait) name++;
+    bool isTorvane = name && strcmp(name, "Torvane") == 0;
+    if (isTorvane) {
+        name = "Korvel";
+        subtype = "Torvane";
+    }
+    if (mustWait) g_ScriptingActive.wait(false);
+    std::unique_ptr<KorvelScript::AutoLock> turn;
+    if (s_ConnectLock) turn = std::make_unique<KorvelScript::AutoLock>(g_ConnectLock);
+    ptr<RemoteApp> app = RemoteApp::NewByName(name, subtype, uuid, host, timeOut);
+    if (s_EarlyConnectLock) turn.reset();
+    ScriptVal root = app->GetRoot();
+    if (!app->Connect()) return {};
+    return isTorvane ? root.CallMember("GetTorvane") : root;
+}
+
+ScriptVal AsyncScriptApp(const char* name, const char* subtype, ScriptVal uuid, const char* host,
+                         double timeOut, bool connect) {
+    ptr<RemoteApp> app = RemoteApp::NewByName(name, subtype, uuid, host, timeOut);
+    ScriptVal root = app->GetRoot();
+    if (connect) app->AsyncConnect();
+    return root;
+}
+
+bool ScriptLogin(const char* host, const char* name, const char* user, const char* password) {
+    ScriptVal root = ScriptApp(name, nullptr, ScriptVal(), host, kLoginTimeOut);
+    return root.CallMember("__Login", user, password).ToBoolean();
 }
 
 ScriptVal ScriptApp(unsigned int ip, unsigned int port, ScriptVal& reply) {

@@ -1,5 +1,7 @@
-// The members by which a peer introduces itself to a host.
+// The members by which a peer introduces itself to a host, and logs in.
 #include <algorithm>
+#include <atomic>
+#include <cstring>
 #include <utility>
 #include <vector>
 
@@ -29,18 +31,9 @@ ScriptVal TakeProcessData(const ScriptVal& processID, const RemoteApp& app) {
         KorvelScript::AutoLock guard(g_ProcLock);
         if (!g_ProcIDs.FindKeyConst(processID).IsTable()) return {};
     }
-    if (!RemoteApp::IsLocalIP(app.GetIPAddress())) return {};
+    if (!app.IsPeerLocal()) return {};
     KorvelScript::AutoLock guard(g_ProcLock);
-    TableEntry* chain = g_ProcIDs.TakeTable();
-    TableEntry** link = &chain;
-    while (*link && (*link)->m_Key != processID) link = &(*link)->m_Next;
-    TableEntry* entry = *link;
-    if (entry) *link = std::exchange(entry->m_Next, nullptr);
-    g_ProcIDs.SetTable(chain);
-    if (!entry) return {};  // another thread was first
-    ScriptVal data = std::move(entry->m_Value);
-    ReleaseChain(entry);
-    return data;
+    return TakeProcessDataLocked(processID);  // nil when another thread was first
 }
 
 bool IsWelcome(RemoteApp* app) {
@@ -69,12 +62,25 @@ public:
         args.Return(answer);
     }
 
-    // TODO(remote): asks the host. It lets everybody in so far.
-    void _SF___Login(ScriptArgs& args, ScriptSymbol*, bool) { args.ReturnBoolean(true); }
+    void _SF___Login(ScriptArgs& args, ScriptSymbol*, bool) {
+        RemoteApp* app = args.GetApp();
+        ScriptConfig* config = g_ScriptConfig.load(std::memory_order_acquire);
+        if (!app || app->IsLoggedIn() || !config || !config->WantsLogin()) {
+            return args.ReturnBoolean(true);
+        }
+        bool isGood = config->Login(config->m_UserData, app, args[1].ToString(""),
+                                    args[2].ToString(""), nullptr);
+        if (isGood) app->SetLoggedIn(args.m_Value.m_Args.m_Run);
+        args.ReturnBoolean(isGood);
+    }
 };
 
-constinit ScriptSymbol* g_LoginSym = nullptr;
-constinit ScriptSymbol* g_ConnectSym = nullptr;
+constexpr char kLoginName[] = "__Login";
+constexpr char kConnectName[] = "__Connect";
+
+// Read by any thread, as addresses alone.
+constinit std::atomic<ScriptSymbol*> g_LoginSym{nullptr};
+constinit std::atomic<ScriptSymbol*> g_ConnectSym{nullptr};
 
 // A symbol that has been withdrawn. What calls it by its function value holds it; a look-up by name
 // takes no lock, and may stand on it a moment longer.
@@ -104,17 +110,27 @@ ScriptSymbol* Publish(ScriptInfo& info, const char* name,
 
 void PublishHostMembers(ScriptInfo& info) {
     DeleteWithdrawn();
-    g_LoginSym = Publish(info, "__Login", &GlobalScripting::_SF___Login);
-    g_ConnectSym = Publish(info, "__Connect", &GlobalScripting::_SF___Connect);
+    g_LoginSym = Publish(info, kLoginName, &GlobalScripting::_SF___Login);
+    g_ConnectSym = Publish(info, kConnectName, &GlobalScripting::_SF___Connect);
 }
 
 void WithdrawHostMembers() {
     DeleteWithdrawn();
-    for (ScriptSymbol** symbol : {&g_LoginSym, &g_ConnectSym}) {
-        if (!*symbol) continue;
-        (*symbol)->Withdraw();
-        s_Withdrawn.push_back({std::exchange(*symbol, nullptr), NowNs()});
+    for (std::atomic<ScriptSymbol*>* place : {&g_LoginSym, &g_ConnectSym}) {
+        ScriptSymbol* symbol = place->exchange(nullptr);
+        if (!symbol) continue;
+        symbol->Withdraw();
+        s_Withdrawn.push_back({symbol, NowNs()});
     }
+}
+
+bool IsHostMember(const char* name) {
+    return strcmp(name, kLoginName) == 0 || strcmp(name, kConnectName) == 0;
+}
+
+bool IsHostMember(uint64_t function) {
+    return function && (function == reinterpret_cast<uintptr_t>(g_LoginSym.load()) ||
+                        function == reinterpret_cast<uintptr_t>(g_ConnectSym.load()));
 }
 
 }  // namespace Korvel

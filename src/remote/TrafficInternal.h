@@ -242,14 +242,19 @@ struct EndWaiter : Reuser, Waiter {
 struct RemoteApp::Traffic {
     // Guarded by the connection's lock
     bool m_IsRunning = false;
-    bool m_IsBeginning = false;             // a thread makes it run
-    uint16_t m_Run = 0;                     // which run it is, or was; not 0 once there was one
-    bool m_HasThread = false;               // which has not come to its very end
-    EndWaiter* m_EndWaiters = nullptr;      // for that, a chain
-    bool m_IsServing = false;               // number 1 is counted for the peer
-    bool m_WantsEnd = false;                // Disconnect: when nothing is under way any more
-    Platform::_Socket* m_Socket = nullptr;  // kInProcess within the process
-    RemoteApp* m_Peer = nullptr;            // there; holds a use
+    bool m_IsBeginning = false;                 // a thread makes it run
+    bool m_IsConnecting = false;                // a thread connects it, by name or by address
+    bool m_IsCancelled = false;                 // that shall end
+    Platform::_SocketSet* m_CallSet = nullptr;  // on which that thread waits for the peer
+    int m_CancelEvent = 0;                      // of that set
+    RemoteApp* m_Server = nullptr;              // that it asks; the thread's
+    uint16_t m_Run = 0;                         // which run it is, or was; not 0 once there was one
+    bool m_HasThread = false;                   // which has not come to its very end
+    EndWaiter* m_EndWaiters = nullptr;          // for that, a chain
+    bool m_IsServing = false;                   // number 1 is counted for the peer
+    bool m_WantsEnd = false;                    // Disconnect: when nothing is under way any more
+    Platform::_Socket* m_Socket = nullptr;      // kInProcess within the process
+    RemoteApp* m_Peer = nullptr;                // there; holds a use
     uint32_t m_LastContext = 0;
     RequestTable m_Requests;
     int64_t m_NextDeadlineNs = INT64_MAX;  // no asynchronous request is due earlier
@@ -272,7 +277,9 @@ struct RemoteApp::Traffic {
     std::atomic<bool> m_IsAsleep{false};
     // Set under the lock, for the run that there is
     std::atomic<bool> m_IsRefused{false};  // nothing more is done for the peer
-    std::atomic<bool> m_MustQuit{false};   // _Disconnect: stop sending, and end with the peer
+    std::atomic<bool> m_IsLoggedIn{true};  // the peer, or it need not
+    std::atomic<PeerKind> m_PeerKind{PeerKind::Caller};
+    std::atomic<bool> m_MustQuit{false};            // _Disconnect: end with the peer, or soon
     std::atomic<const char*> m_WhyClosed{nullptr};  // set to end at once
 
     // Connection thread
@@ -289,6 +296,7 @@ struct RemoteApp::Traffic {
     int m_Threshold = 1;      // bytes that the socket has to have
     bool m_HasEnded = false;  // what the peer has to say
     int64_t m_QuitLimitNs = 0;
+    bool m_IsShut = false;      // for sending
     int64_t m_NextCheckNs = 0;  // of the peer
     int64_t m_OwedSinceNs = 0;  // a sign of life; 0 when it owes none
     int64_t m_ProgressNs = 0;   // when the queue was last found short, or moving

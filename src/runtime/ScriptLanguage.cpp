@@ -7,6 +7,7 @@
 #include "Platform/NoKillInternal.h"
 #include "Platform/Threads.h"
 #include "Platform/Time.h"
+#include "remote/ScriptPortInternal.h"
 #include "runtime/Script.h"
 #include "runtime/ScriptDebug.h"
 #include "runtime/lua/LuaLanguage.h"
@@ -153,8 +154,8 @@ void ScriptLanguage::PutState(ScriptState* state) {
     m_Pool.Add(state);
 }
 
-int ScriptLanguage::ExecuteFileExternal(const char*, const ScriptVal&) {
-    return 1;
+int ScriptLanguage::ExecuteFileExternal(const char* file, const ScriptVal& value) {
+    return StartScriptProcess(GetShortName(), file, value) ? 0 : 1;
 }
 
 void InitLanguages(const TagList& tags) {

@@ -54,8 +54,9 @@ public:
     // Takes over a state that is idle; ScriptState::Done is the way to call it.
     virtual void PutState(ScriptState* state);
 
-    // Runs a file in a process of its own. 0 when the process has been started, else 1; no process
-    // can be started so far.
+    // Runs a file in a process of its own, by the tool that StartServer tells of. The process calls
+    // this one, which has to be a host, and gets `value`, a table, as its start-up data. 0 when it
+    // has been started; else 1, with the reason in the log, also for a name with a double quote.
     virtual int ExecuteFileExternal(const char* file, const ScriptVal& value);
     // What stands between an object and the name of a member that is called.
     virtual const char* GetMemberCallToken() = 0;

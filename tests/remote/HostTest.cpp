@@ -7,8 +7,6 @@
 #include <atomic>
 #include <condition_variable>
 #include <deque>
-#include <fstream>
-#include <iterator>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -25,13 +23,6 @@ namespace {
 
 using namespace Korvel::Test;
 
-// Whether a thread waits for something, or has ended.
-bool IsAsleep(pid_t thread) {
-    std::ifstream file("/proc/self/task/" + std::to_string(thread) + "/stat");
-    std::string text(std::istreambuf_iterator<char>(file), {});
-    return text.empty() || text.find(") S") != std::string::npos;
-}
-
 // A host whose UI thread is the test's. It runs its jobs when the test says so.
 class HostTest : public testing::Test {
 protected:
@@ -45,7 +36,10 @@ protected:
         g_NoGUI = false;
     }
     ~HostTest() override {
-        RunUI([this] { return Box::s_NumAlive == 1 && m_Host.m_Root->GetCount() == 1; });
+        RunUI([this] {
+            return GetNumConnections() == 0 && Box::s_NumAlive == 1 &&
+                   m_Host.m_Root->GetCount() == 1;
+        });
         g_NoGUI = true;
     }
 
@@ -288,6 +282,17 @@ TEST_F(HostTest, NeedsNoOwnerForWhoIsServed) {
     app->Recycle();
     RunUI([&] { return app->GetUseCount() == 1; });
     app->Recycle();
+}
+
+TEST_F(HostTest, SendsWhatIsQueuedBeforeTheEnd) {
+    Bare peer;
+    std::string bytes(4 << 20, 'x');
+    peer.m_App->SetStateData(ScriptVal(bytes.c_str()));
+    peer.m_App->_Disconnect(0);
+    Packet* packet = peer.Receive();
+    ASSERT_TRUE(packet && packet->m_Type == PKT_SetStateData);
+    FreePkt(packet);
+    EXPECT_EQ(peer.Receive(), nullptr);
 }
 
 // What the peer's machine does when it is cut off: it takes nothing and answers nothing.

@@ -4,6 +4,9 @@
 #include <malloc.h>
 
 #include <cstdlib>
+#include <fstream>
+#include <iterator>
+#include <string>
 
 #include "Platform/Time.h"
 #include "core/0ReusePool.h"
@@ -51,6 +54,12 @@ bool WaitUntil(const std::function<bool()>& isSo) {
         Platform::Wait(1);
     }
     return true;
+}
+
+bool IsAsleep(pid_t thread) {
+    std::ifstream file("/proc/self/task/" + std::to_string(thread) + "/stat");
+    std::string text(std::istreambuf_iterator<char>(file), {});
+    return text.empty() || text.find(") S") != std::string::npos;
 }
 
 void Setting::Set(const char* value) const {

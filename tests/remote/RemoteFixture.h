@@ -2,6 +2,7 @@
 
 // What the tests of connections share.
 #include <gtest/gtest.h>
+#include <sys/types.h>
 
 #include <atomic>
 #include <functional>
@@ -21,6 +22,9 @@ constexpr unsigned int kLoopback = 0x0100007F;  // 127.0.0.1 in network order
 
 // Looks until something is so that other threads bring about; false when it takes too long.
 bool WaitUntil(const std::function<bool()>& isSo);
+
+// Whether a thread of this process waits for something, or has ended.
+bool IsAsleep(pid_t thread);
 
 // The descriptors that the process has open.
 int CountDescriptors();

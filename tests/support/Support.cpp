@@ -1,7 +1,9 @@
 #include "Support.h"
 
 #include <fcntl.h>
+#include <netinet/in.h>
 #include <spawn.h>
+#include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -13,14 +15,43 @@
 #include <sstream>
 #include <stdexcept>
 
+#include "remote/ScriptServer.h"
+
 namespace Korvel::Test {
 namespace {
+
+constexpr char kNoTool[] = "/nonexistent";
 
 std::string ReadFile(const std::string& path) {
     std::ifstream file(path, std::ios::binary);
     std::stringstream content;
     content << file.rdbuf();
     return content.str();
+}
+
+bool IsFree(unsigned int port) {
+    bool isFree = true;
+    for (int type : {SOCK_STREAM, SOCK_DGRAM}) {
+        int socket = ::socket(AF_INET, type | SOCK_CLOEXEC, 0);
+        sockaddr_in address = {};
+        address.sin_family = AF_INET;
+        address.sin_port = htons(static_cast<uint16_t>(port));
+        isFree =
+            isFree && bind(socket, reinterpret_cast<sockaddr*>(&address), sizeof(address)) == 0;
+        close(socket);
+    }
+    return isFree;
+}
+
+void SetServerPort(unsigned int port) {
+    setenv("KORVEL_ScriptServerPort", std::to_string(port).c_str(), 1);
+    g_ScriptServerPort = port;
+}
+
+// Ahead of all code that starts something.
+[[gnu::constructor]] void SetUpServer() {
+    SetServerPort(FreePort());
+    setenv("KORVEL_Tool", kNoTool, 0);
 }
 
 std::vector<char*> Pointers(const std::vector<std::string>& texts) {
@@ -31,6 +62,25 @@ std::vector<char*> Pointers(const std::vector<std::string>& texts) {
 }
 
 }  // namespace
+
+unsigned int FreePort() {
+    constexpr unsigned int kFirst = 20000, kCount = 10000;
+    static unsigned int s_Next = static_cast<unsigned int>(getpid());
+    unsigned int port;
+    do {
+        port = kFirst + s_Next++ % kCount;
+    } while (!IsFree(port));
+    return port;
+}
+
+ServerTool::ServerTool(const char* program) {
+    SetServerPort(FreePort());
+    setenv("KORVEL_Tool", program, 1);
+}
+
+ServerTool::~ServerTool() {
+    setenv("KORVEL_Tool", kNoTool, 1);
+}
 
 TempDir::TempDir() {
     std::string path = std::filesystem::temp_directory_path() / "korvelscript-XXXXXX";
@@ -72,14 +122,14 @@ ProcessResult RunProcess(const std::vector<std::string>& argv,
             ReadFile(dir.Path("out")), ReadFile(dir.Path("err"))};
 }
 
-HostProcess::HostProcess(const char* program, const char* option) {
+HostProcess::HostProcess(const char* program, const char* option, const char* value) {
     int ends[2];
     if (pipe2(ends, O_CLOEXEC) != 0) throw std::runtime_error("no pipe");
     m_Process = fork();
     if (m_Process == 0) {
         dup2(ends[1], STDOUT_FILENO);
-        setenv("KORVEL_ListenAddress", "127.0.0.1", 1);
-        execl(program, program, option, nullptr);
+        setenv("KORVEL_ListenAddress", "127.0.0.1", 0);
+        execl(program, program, option, value, nullptr);
         _exit(127);
     }
     close(ends[1]);

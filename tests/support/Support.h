@@ -24,6 +24,21 @@ private:
     std::string m_Path;
 };
 
+// A port of this machine that nobody has, for TCP and UDP, and that the system gives to nobody by
+// itself. Each test process looks at other ones first, and has one of them as the port of its
+// script server.
+unsigned int FreePort();
+
+// While it lives, hosts start this program as their script server, at a port that no other test
+// has. Without it they run without a server.
+class ServerTool {
+public:
+    explicit ServerTool(const char* program);
+    ServerTool(const ServerTool&) = delete;
+    ServerTool& operator=(const ServerTool&) = delete;
+    ~ServerTool();
+};
+
 // What a finished process has left behind.
 struct ProcessResult {
     int m_Status;  // exit status, or -1 - signal when a signal ended it
@@ -39,7 +54,8 @@ ProcessResult RunProcess(const std::vector<std::string>& argv,
 // The example host, as a process.
 class HostProcess {
 public:
-    explicit HostProcess(const char* program, const char* option = nullptr);
+    explicit HostProcess(const char* program, const char* option = nullptr,
+                         const char* value = nullptr);
     HostProcess(const HostProcess&) = delete;
     HostProcess& operator=(const HostProcess&) = delete;
     ~HostProcess();  // kills it

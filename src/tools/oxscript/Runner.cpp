@@ -164,7 +164,7 @@ std::string Quote(const std::string& text) {
 
 }  // namespace
 
-Runner::Runner(ScriptLanguage* language, std::vector<std::string> args, const ScriptVal& app,
+Runner::Runner(ScriptLanguage* language, std::vector<std::string> args, const Application& app,
                const char* prefix, bool isInteractive)
     : m_Language(language),
       m_Args(std::move(args)),
@@ -193,7 +193,8 @@ void Runner::Start() {
     m_State->SetPrintFuncs(nullptr, OnError, this);
     m_State->Execute(kDescribeErrors, 0, "=oxscript");
     SetArgs();
-    if (!m_App.IsNil()) m_State->SetGlobal("app", m_App);
+    if (!m_App.m_Object.IsNil()) m_State->SetGlobal("app", m_App.m_Object);
+    if (!m_App.m_Startup.IsNil()) m_State->SetGlobal("startup", m_App.m_Startup);
     // What a file finds as `globals` is at a prompt the same as _G.
     if (m_IsInteractive) m_State->Execute("jit.off() globals = _G", 0, "=oxscript");
 }
@@ -275,7 +276,7 @@ int Runner::TakeStatus(unsigned int result) {
 
 std::string Runner::Ask(const std::string& text) {
     std::string answer;
-    RemoteApp* app = m_App.GetApp();
+    RemoteApp* app = m_App.m_Object.GetApp();
     double timeOut = app ? app->SetTimeOut(kAnswerSeconds) : 0;
     m_State->SetPrintFuncs(OnAnswer, OnAnswer, &answer);
     unsigned int result = m_State->Execute(text.c_str(), 0, "=oxscript");
@@ -314,7 +315,7 @@ void Runner::ShowPendingErrors() {
 
 // Once. It may be why a script has failed, or has got nothing but nil.
 void Runner::TellIfApplicationHasGone() {
-    RemoteApp* app = m_App.GetApp();
+    RemoteApp* app = m_App.m_Object.GetApp();
     if (!app || app->Connected() || std::exchange(m_HasToldOfEnd, true)) return;
     WriteError(std::string(m_Prefix).append(app->GetName()).append(" has gone.\n").c_str());
 }

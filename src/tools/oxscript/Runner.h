@@ -6,6 +6,7 @@
 
 #include "runtime/Script.h"
 #include "runtime/ScriptLanguage.h"
+#include "tools/oxscript/Application.h"
 
 namespace Korvel::Oxscript {
 
@@ -22,9 +23,9 @@ namespace Korvel::Oxscript {
 //          behind. There is at most one Runner at a time.
 class Runner {
 public:
-    // `args` is the script and its arguments, `app` the global of that name.
+    // `args` is the script and its arguments; `app` becomes the globals `app` and `startup`.
     Runner(KorvelScript::ScriptLanguage* language, std::vector<std::string> args,
-           const ScriptVal& app, const char* prefix, bool isInteractive);
+           const Application& app, const char* prefix, bool isInteractive);
     Runner(const Runner&) = delete;
     Runner& operator=(const Runner&) = delete;
     ~Runner();
@@ -61,7 +62,7 @@ private:
 
     KorvelScript::ScriptLanguage* const m_Language;
     std::vector<std::string> m_Args;
-    const ScriptVal m_App;
+    const Application m_App;
     const char* const m_Prefix;
     const bool m_IsInteractive;
     KorvelScript::ScriptState* m_State = nullptr;  // owned
