@@ -1,5 +1,5 @@
-# `cmake --install`: the library, its names as a Lua module, the tool, the headers, a CMake package
-# and a pkg-config file.
+# `cmake --install`: the library, its names as a Lua module, the tool with its manual page and a user
+# unit for systemd, the headers, a CMake package and a pkg-config file.
 
 include(CMakePackageConfigHelpers)
 
@@ -15,6 +15,16 @@ install(FILES ${PROJECT_BINARY_DIR}/src/lua/krscript.so
     DESTINATION ${CMAKE_INSTALL_LIBDIR}/lua/5.1
 )
 install(TARGETS oxscript RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
+configure_file(src/tools/oxscript/oxscript.1.in ${CMAKE_CURRENT_BINARY_DIR}/oxscript.1 @ONLY)
+install(FILES ${CMAKE_CURRENT_BINARY_DIR}/oxscript.1 DESTINATION ${CMAKE_INSTALL_MANDIR}/man1)
+# The unit names the tool by its full path, which `--prefix` may change.
+install(CODE "
+    set(CMAKE_INSTALL_FULL_BINDIR \"${CMAKE_INSTALL_BINDIR}\")
+    cmake_path(ABSOLUTE_PATH CMAKE_INSTALL_FULL_BINDIR BASE_DIRECTORY \"\${CMAKE_INSTALL_PREFIX}\")
+    configure_file(\"${PROJECT_SOURCE_DIR}/src/tools/oxscript/oxscript-server.service.in\"
+        \"${CMAKE_CURRENT_BINARY_DIR}/oxscript-server.service\" @ONLY)
+")
+install(FILES ${CMAKE_CURRENT_BINARY_DIR}/oxscript-server.service DESTINATION lib/systemd/user)
 foreach(header IN LISTS KORVEL_PUBLIC_HEADERS)
     cmake_path(GET header PARENT_PATH folder)
     install(FILES src/${header} DESTINATION ${KORVEL_HEADER_DIR}/${folder})

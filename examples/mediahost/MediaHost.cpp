@@ -8,6 +8,13 @@
 
 using namespace Korvel;
 
+ScriptVal MediaHost::GetPingInfo() const {
+    ScriptVal info(SV_Table, nullptr);
+    info["Title"] = m_Title.c_str();
+    info["Progress"] = m_Timeline->GetProgress();
+    return info;
+}
+
 KORVEL_PUBLISH(
     MediaHost, "MediaHost", "A small media application.",
     "It has one timeline. Start at app.Timeline, and app:GetHelp() tells the rest. The constant "
@@ -31,6 +38,11 @@ KORVEL_VARIABLE(MediaHost, Progress, SSF_Read | SSF_AnyThread | SSF_DelayGet,
                 {SYMT_ShortHelp, "How much has been rendered, from 0 to 1."},
                 {SYMT_SeeAlso, "Timeline:Render"}) {
     args.ReturnNumber(self.m_Timeline->GetProgress());
+}
+
+// The script server asks for it every few seconds, and gives it to whoever pings the host.
+KORVEL_FUNCTION(MediaHost, GetPingInfo, 0, {SYMT_ShortHelp, "What others may see of this host."}) {
+    args.Return(self.GetPingInfo());
 }
 
 // A constant belongs to all objects of the host. Lists of members leave constants out, so the help

@@ -10,6 +10,9 @@ class MediaHost : public Korvel::Scripted<SharedObject> {
 public:
     MediaHost() { SetScriptClass(); }
 
+    // What the network is told of it, a table. On the UI thread, once there are scripts.
+    Korvel::ScriptVal GetPingInfo() const;
+
 private:
     std::string m_Title = "Untitled";
     Korvel::ptr<Timeline> m_Timeline{new Timeline};

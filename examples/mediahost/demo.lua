@@ -1,5 +1,5 @@
--- What a script does with the application of mediahost. Run it with the port that mediahost prints:
---   oxscript -a PORT demo.lua
+-- What a script does with the application of mediahost, while that runs:
+--   oxscript --host MediaHost demo.lua
 local function heading(text)
     print("\n" .. text .. "\n" .. ("-"):rep(#text))
 end

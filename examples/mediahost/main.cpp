@@ -1,10 +1,13 @@
-// A small media application without a window, for scripts in other processes. It prints the port at
-// which it can be reached, and runs until it gets SIGINT or SIGTERM, or a script calls app:Quit().
+// A small media application without a window, for scripts in other processes, which find it by the
+// name "MediaHost". It prints the port at which it can be reached, and runs until it gets SIGINT or
+// SIGTERM, or a script calls app:Quit().
 //
 // Build it against the installed library:
 //   g++ -std=c++20 *.cpp $(pkg-config --cflags --libs korvelscript)
+#include <cmath>
 #include <csignal>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 
 #include "MediaHost.h"
@@ -16,13 +19,47 @@
 using namespace Korvel;
 
 static constexpr char kUsage[] =
-    "Usage: mediahost [--debug]\n"
-    "Prints the port at which scripts reach it, and runs until SIGINT or SIGTERM.\n"
-    "  --debug  with the members that are for debugging\n"
-    "KORVEL_ListenAddress in the environment is the address to listen at, any by default;\n"
-    "127.0.0.1 keeps other machines out.\n";
+    "Usage: mediahost [--debug] [--priority N]\n"
+    "Prints the port at which scripts reach it, and runs until SIGINT or SIGTERM. Scripts find it "
+    "by\n"
+    "the name MediaHost; the script server of this machine is started when it does not run.\n"
+    "  --debug       with the members that are for debugging\n"
+    "  --priority N  of several, the one with the highest is what scripts get that ask for the\n"
+    "                subtype 'render': orv.scriptapp('MediaHost', nil, 5, nil, 'render')\n"
+    "In the environment: KORVEL_ListenAddress is the address to listen at, any by default; "
+    "127.0.0.1\n"
+    "keeps other machines out. KORVEL_ScriptServerPort is the port of the script server.\n";
 
 static UIThread* s_UIThread;
+static bool s_IsDebug = false;
+static double s_Priority = NAN;  // none
+
+// False where the command line makes no sense.
+static bool ReadOptions(int argc, char** argv) {
+    for (int i = 1; i < argc; i++) {
+        if (strcmp(argv[i], "--debug") == 0) {
+            s_IsDebug = true;
+        } else if (strcmp(argv[i], "--priority") == 0 && i + 1 < argc) {
+            char* end;
+            s_Priority = strtod(argv[++i], &end);
+            if (*end || end == argv[i]) return false;
+        } else {
+            return false;
+        }
+    }
+    return true;
+}
+
+// What the script server is told, besides the name, the process and the port.
+static ScriptVal GetHostInfo(const MediaHost& host) {
+    ScriptVal info(SV_Table, nullptr);
+    info["PingInfo"] = host.GetPingInfo();
+    if (!std::isnan(s_Priority)) {
+        info["Priorities"] = SV_Table;
+        info["Priorities"]["render"] = s_Priority;
+    }
+    return info;
+}
 
 // The set of signals that end the application, which only the main thread waits for.
 static sigset_t BlockSignals() {
@@ -35,14 +72,13 @@ static sigset_t BlockSignals() {
 }
 
 int main(int argc, char** argv) {
-    static bool s_IsDebug = false;
-    if (argc > 1) {
-        bool wantsHelp = strcmp(argv[1], "--help") == 0;
-        s_IsDebug = argc == 2 && strcmp(argv[1], "--debug") == 0;
-        if (!s_IsDebug) {
-            fputs(kUsage, wantsHelp ? stdout : stderr);
-            return wantsHelp ? 0 : 2;
-        }
+    if (argc == 2 && strcmp(argv[1], "--help") == 0) {
+        fputs(kUsage, stdout);
+        return 0;
+    }
+    if (!ReadOptions(argc, argv)) {
+        fputs(kUsage, stderr);
+        return 2;
     }
     sigset_t signals = BlockSignals();
     UIThread thread;
@@ -67,7 +103,7 @@ int main(int argc, char** argv) {
     g_NoGUI = false;  // there is a UI thread: members run there
 
     _InitScripting(config);
-    if (!StartScripting(ScriptVal()) || !GetListenPort()) {
+    if (!StartScripting(GetHostInfo(*host.Get())) || !GetListenPort()) {
         fprintf(stderr,
                 "mediahost: cannot listen; is KORVEL_ListenAddress an address of this machine?\n");
         return 1;

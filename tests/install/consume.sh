@@ -52,3 +52,15 @@ fi
 
 unset LD_LIBRARY_PATH
 "$place/installed/bin/oxscript" --version
+
+# The manual page has every option of the tool, and no mistake that can be found here.
+page=$place/installed/share/man/man1/oxscript.1
+for option in $("$place/installed/bin/oxscript" --help | sed -n 's/^  \(-[-A-Za-z]*\).*/\1/p'); do
+    sed 's/\\//g' "$page" | grep -q -e "$option" || { echo "$page has no $option"; exit 1; }
+done
+if command -v groff >/dev/null; then
+    groff -man -Tutf8 -ww "$page" >"$place/page" 2>"$place/warnings"
+    [ ! -s "$place/warnings" ] || { cat "$place/warnings"; exit 1; }
+fi
+grep -q "^ExecStart=$place/installed/bin/oxscript -s" \
+    "$place/installed/lib/systemd/user/oxscript-server.service"

@@ -53,7 +53,7 @@ TEST_F(KRScriptLib, HelpersOfScripts) {
         end
         function path(name) return table.concat({splitpath(name)}, '|') end)");
     const char* checks[] = {
-        "getpid == orv.getpid and wait == orv.wait and exit == os.exit and ThisApp == nil",
+        "getpid == orv.getpid and wait == orv.wait and exit == os.exit and ThisApp() == nil",
         "Using == orv.using and SetActiveComp == Using and GetUsing == orv.getusing",
         "iif(false, 1, 2) == 2 and iif(0, 1, 2) == 1",
         "do_(function() return false end) == false and do_(function() end) == true",

@@ -96,7 +96,7 @@ TEST_F(LuaStateTest, RunsTexts) {
         {"print(_EXITCODE, _EXITDATA.a, OxPLATFORM_LINUX)", 0, "3\t1\ttrue\n"},
         {"orv.exit('x')", 0, "|1|\n"},
         {"print(_EXITCODE, _EXITDATA)", 0, "0\tnil\n"},
-        {"print(ThisApp, _initffi())", 0, "nil\n"},
+        {"print(ThisApp(), _initffi())", 0, "nil\n"},
     };
     for (const Case& c : cases) {
         EXPECT_EQ(Run(c.m_Text, c.m_Flags), c.m_Printed) << c.m_Text;
@@ -189,6 +189,7 @@ TEST_F(LuaStateTest, TakesNamesOnlyThatCanStandInAProgram) {
         EXPECT_EQ(m_Out, "");
         EXPECT_NE(Take(0).find("is no name for a global."), std::string::npos) << name;
     }
+    Run("ThisApp = nil");  // nobody would answer it
     m_State->SetThisApp("fine.path_1", "short");
     EXPECT_NE(Take(0).find("attempt to call global 'ThisApp' (a nil value)"), std::string::npos);
     // The four halves of the address and the reference arrive whole, whatever `class` makes of

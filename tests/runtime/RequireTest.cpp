@@ -8,8 +8,10 @@
 namespace Korvel {
 namespace {
 
+using Test::HostProcess;
 using Test::ProcessResult;
 using Test::RunProcess;
+using Test::ServerTool;
 using Test::TempDir;
 
 class Require : public testing::TestWithParam<const char*> {};
@@ -52,6 +54,27 @@ TEST_P(Require, OpensTheHostLibrary) {
     EXPECT_EQ(result.m_Status, 1);
     EXPECT_EQ(result.m_Err.find("told\n" + std::string(GetParam()) + ": last\n"), 0u)
         << result.m_Err;
+}
+
+// There the process is a client: it finds hosts, and what it has sent last arrives.
+TEST_P(Require, MakesAClient) {
+    std::string folder = std::filesystem::path(SHARED_LIBRARY).parent_path().string();
+    ServerTool tool(OXSCRIPT);
+    HostProcess host(MEDIAHOST);
+    TempDir dir;
+    std::string script = dir.Write("script.lua", R"(
+        require "krscript"
+        assert(orv.getappname() == "korvelscript" and orv.scriptapp("Nobody") == nil)
+        local host = orv.scriptapp("MediaHost", nil, 10)
+        host.Title = "Plain"
+        assert(host.Title == "Plain" and host:GetAppData().Name == "MediaHost")
+        assert(not pcall(orv.sendnotify, host, io.stdout))
+        orv.sendnotify(host, "Quit"))");
+    std::vector<std::string> settings = {"LUA_CPATH=" + folder + "/?.so", "LD_PRELOAD=" PRELOAD,
+                                         "ASAN_OPTIONS=detect_leaks=0"};
+    ProcessResult result = RunProcess({GetParam(), script}, settings);
+    EXPECT_EQ(result.m_Status, 0) << result.m_Err;
+    EXPECT_EQ(host.End(0), 0);
 }
 
 INSTANTIATE_TEST_SUITE_P(Interpreters, Require, testing::Values("luajit", "lua5.1"));

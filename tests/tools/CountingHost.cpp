@@ -146,6 +146,7 @@ int Run() {
         return 0;
     };
     thread.Execute(letGo, host.Get(), nullptr, true);
+    StopScripting();  // the script server has the host's object, too
     for (int ms = 0; ms < kLimitMs && !HasAll(*host.Get(), false); ms++) Platform::Wait(1);
     bool hasAll = HasAll(*host.Get(), true);
     CleanupScripting();

@@ -98,6 +98,28 @@ void InsertLoader(lua_State* L, lua_CFunction loader) {
     lua_pop(L, 1);
 }
 
+// Returns the table `orv`.
+int OpenHostLib(lua_State* L) {
+    register_memblock(L);
+    luaL_register(L, "orv", kFunctions);
+    luaL_register(L, nullptr, kRemoteFunctions);
+    int orv = lua_gettop(L);
+    lua_pushliteral(L, "_VERSION");
+    lua_pushstring(L, kVersion);
+    lua_rawset(L, orv);
+    OpenTwin(L, "ondry", orv);
+    lua_getglobal(L, "os");
+    if (lua_istable(L, -1)) {
+        lua_getfield(L, orv, "exit");
+        lua_setfield(L, -2, "exit");
+    }
+    lua_settop(L, orv);
+    s_LuaType_RemoteObject.lw_register(L);
+    RunStartupScripts(L);
+    SetGlobalIndex(L);
+    return 1;
+}
+
 }  // namespace
 
 void OpenAllLibs(lua_State* L, TagList*) {
@@ -111,7 +133,7 @@ void OpenAllLibs(lua_State* L, TagList*) {
     lua_setfield(L, -2, "lpeg");
     require(L, "lpeg", true);
     lua_getfield(L, package, "loaded");
-    luaopen_krscript(L);
+    OpenHostLib(L);
     lua_setfield(L, -2, "krscript");
     lua_settop(L, 0);
     lua_gc(L, LUA_GCRESTART, -1);  // with the pause that follows a collection
@@ -146,21 +168,6 @@ void SetArgs(lua_State* L, char** argv, int first) {
 }  // namespace Korvel
 
 extern "C" int luaopen_krscript(lua_State* L) {
-    Korvel::register_memblock(L);
-    luaL_register(L, "orv", Korvel::kFunctions);
-    int orv = lua_gettop(L);
-    lua_pushliteral(L, "_VERSION");
-    lua_pushstring(L, Korvel::kVersion);
-    lua_rawset(L, orv);
-    Korvel::OpenTwin(L, "ondry", orv);
-    lua_getglobal(L, "os");
-    if (lua_istable(L, -1)) {
-        lua_getfield(L, orv, "exit");
-        lua_setfield(L, -2, "exit");
-    }
-    lua_settop(L, orv);
-    Korvel::s_LuaType_RemoteObject.lw_register(L);
-    Korvel::RunStartupScripts(L);
-    Korvel::SetGlobalIndex(L);
-    return 1;
+    Korvel::EnsureConfig();
+    return Korvel::OpenHostLib(L);
 }

@@ -9,8 +9,9 @@ extern "C" {
 // Opens the host library in an interpreter: the tables `orv` and `ondry`, which hold the same
 // functions, an `os.exit` that ends the script instead of the process, the globals of older
 // scripts, and globals that are members of the active object. It is what `require "krscript"`
-// calls, also in an interpreter that is not ours, so it keeps to the Lua 5.1 interface. Returns the
-// table `orv`. Raises Lua errors when memory runs out.
+// calls, also in an interpreter that is not ours, so it keeps to the Lua 5.1 interface. A process
+// without a configuration gets one, of a client by the name of "korvelscript", and scripting is
+// started with it. Returns the table `orv`. Raises Lua errors when memory runs out.
 KORVEL_EXPORT int luaopen_krscript(lua_State* L);
 
 }  // extern "C"

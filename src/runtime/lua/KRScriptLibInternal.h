@@ -4,6 +4,8 @@
 #include <lua.hpp>
 #include <string>
 
+#include "core/TextCellInternal.h"
+
 // The parts of the host library. All of it keeps to the Lua 5.1 interface, may raise Lua errors,
 // and holds no object with a destructor across a call that can: in an interpreter that is not ours
 // such an error is a long jump.
@@ -13,6 +15,13 @@ namespace Korvel {
 // members can be used like globals.
 int activeobj(lua_State* L);
 int getactiveobj(lua_State* L);
+
+// The functions by which scripts reach other processes, up to a null.
+extern const luaL_Reg kRemoteFunctions[];
+
+// Installs a configuration of the library's own where there is none, and starts scripting with it:
+// a client that nobody can call.
+void EnsureConfig();
 
 // Whether the globals are looking a name up in the active object: then it is only tried.
 bool IsProbe(lua_State* L);
@@ -50,6 +59,16 @@ void RunStartupScripts(lua_State* L);
 
 // The module searcher for the resource store, a function of package.loaders.
 int myloader(lua_State* L);
+
+// The text at an absolute index, fit for the host: no plain text begins with the marker of a text
+// cell. Null for what is no text.
+inline const char* PlainText(lua_State* L, int index) {
+    const char* text = lua_tostring(L, index);
+    if (!TextCell::IsCell(text)) return text;
+    lua_pushfstring(L, "%c%s", TextCell::SafeFirstByte(*text), text + 1);
+    lua_replace(L, index);
+    return lua_tostring(L, index);
+}
 
 // Globals as they are, past anything that a script has put into the globals' metatable.
 inline void PushGlobalRaw(lua_State* L, const char* name) {

@@ -34,16 +34,6 @@ constexpr int kSlots = 20;        // what an entry may push before it asks for m
 
 constinit EmbeddedScript s_Capture(kCaptureScript);
 
-// The text at an absolute index, fit for the host: no plain text begins with the marker of a text
-// cell. Null for what is no text.
-const char* PlainText(lua_State* L, int index) {
-    const char* text = lua_tostring(L, index);
-    if (!TextCell::IsCell(text)) return text;
-    lua_pushfstring(L, "%c%s", TextCell::SafeFirstByte(*text), text + 1);
-    lua_replace(L, index);
-    return lua_tostring(L, index);
-}
-
 int myprint(lua_State* L) {
     ScriptState* state = GetState(L);
     if (!state) return 0;

@@ -5,9 +5,25 @@ local error, getfenv, loadfile, loadstring, pairs, pcall, rawequal, rawget, sele
     rawget, select, setfenv, setmetatable, tostring, type
 local strmatch, rep, concat = string.match, string.rep, table.concat
 
-getpid, wait, exit = orv.getpid, orv.wait, orv.exit
+getpid, wait, exit, pinghosts = orv.getpid, orv.wait, orv.exit, orv.pinghosts
+StartServer, GetAppName, GetAppUUID = orv.startserver, orv.getappname, orv.getappuuid
+CreateUUID, SendNotify = orv.createuuid, orv.sendnotify
+ScriptApp, AsyncScriptApp = orv.scriptapp, orv.asyncscriptapp
 Using, SetActiveComp = orv.using, orv.using
 GetUsing, GetActiveComp = orv.getusing, orv.getusing
+
+-- The applications of the house, by name.
+for _, name in ipairs { "Korvel", "KorvelServer", "Torvane", "Harwick", "Tessmere" } do
+    globals[name] = function(ip, timeout, uuid, subtype)
+        return orv.scriptapp(name, ip, timeout, uuid, subtype)
+    end
+end
+
+-- The application that this process is; nil where it has no name.
+function ThisApp(timeout)
+    local name = orv.getappname()
+    return name and orv.scriptapp(name, "127.0.0.1", timeout, orv.getappuuid())
+end
 
 -- Raises the error of a helper's first argument where the helper has been called.
 local function check(value, expected, name)
