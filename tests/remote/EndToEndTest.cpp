@@ -335,11 +335,13 @@ TEST_F(EndToEndTest, HostsOfAnotherMachineAreFound) {
     )");
     // Where hosts listen at every address, as they do by themselves.
     Setting anywhere("KORVEL_ListenAddress", "", "");
-    result = RunProcess({"sh", UNSHARE_SCRIPT, MEDIAHOST, OXSCRIPT, script});
-    EXPECT_EQ(result.m_Out,
-              "1\t10.77.0.2\tMediaHost\tMediaHost\tUntitled\n"
-              "false\ttrue\nnil\tnil\n")
-        << result.m_Err;
+    for (std::string mayStart : {"false", "true"}) {
+        Setting allow("KORVEL_AllowRemoteStart", mayStart.c_str(), "false");
+        result = RunProcess({"sh", UNSHARE_SCRIPT, MEDIAHOST, OXSCRIPT, script});
+        EXPECT_EQ(result.m_Out, "1\t10.77.0.2\tMediaHost\tMediaHost\tUntitled\n" + mayStart +
+                                    "\ttrue\nnil\tnil\n")
+            << result.m_Err;
+    }
 }
 
 }  // namespace
