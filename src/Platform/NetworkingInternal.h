@@ -1,5 +1,7 @@
 #pragma once
 
+#include <array>
+#include <bit>
 #include <cstdint>
 
 #include "Platform/Networking.h"
@@ -35,6 +37,11 @@ struct SocketSilence {
     bool m_IsOwed;
 };
 bool GetSocketSilence(_Socket* socket, SocketSilence& silence);
+
+// Whether an address never leaves this machine: 127.0.0.0 to 127.255.255.255.
+inline bool IsLoopback(unsigned int ip) {
+    return std::bit_cast<std::array<unsigned char, 4>>(ip)[0] == 127;
+}
 
 // Makes errno tell that an argument is wrong. Always false.
 bool RefuseArgument();

@@ -7,7 +7,7 @@
 #include <cstring>
 #include <memory>
 
-#include "Platform/Files.h"
+#include "Platform/FilesInternal.h"
 
 namespace Korvel {
 namespace {
@@ -19,10 +19,7 @@ constexpr uint32_t kHeaderSize = sizeof(kMagic) + sizeof(uint32_t);
 constexpr uint64_t kMaxGrowth = 1032;
 constexpr uint64_t kGrowthSlack = 64;
 
-struct Close {
-    void operator()(FILE* file) const { fclose(file); }
-};
-using File = std::unique_ptr<FILE, Close>;
+using Platform::File;
 
 struct Free {
     void operator()(void* p) const { free(p); }
@@ -41,16 +38,11 @@ uint32_t InLittleEndian(uint32_t number) {
     return std::endian::native == std::endian::little ? number : __builtin_bswap32(number);
 }
 
-// The size of a file, at whose end it then stands; −1 when that cannot be told.
-int64_t SizeOf(FILE* file) {
-    return fseeko(file, 0, SEEK_END) == 0 ? ftello(file) : -1;
-}
-
 }  // namespace
 
 MemBlock::MemBlock(const char* filename) {
     File file(Platform::fopen(filename, "rb"));
-    int64_t size = file ? SizeOf(file.get()) : -1;
+    int64_t size = file ? Platform::SizeOf(file.get()) : -1;
     if (size <= 0 || size > UINT32_MAX) return;
     Buffer buffer = NewBuffer(static_cast<size_t>(size));
     rewind(file.get());

@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <cstring>
+#include <memory>
 #include <type_traits>
 #include <utility>
 
@@ -81,6 +82,13 @@ private:
     const char* m_Text;
     size_t m_Length;
 };
+
+// A block of the pools with nothing in it that would have to be destroyed.
+struct FreePoolBlock {
+    void operator()(void* block) const { g_ReusePoolMgr.Free(block); }
+};
+template <class T>
+using PoolBlock = std::unique_ptr<T, FreePoolBlock>;
 
 // A stack of work to be done, for values that nest deeper than the machine's stack. The first
 // `Inline` items need no memory.

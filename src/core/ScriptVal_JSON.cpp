@@ -19,9 +19,6 @@ using Tree = std::unique_ptr<cJSON, DeleteTree>;
 struct FreeText {
     void operator()(char* text) const { cJSON_free(text); }
 };
-struct FreeBlock {
-    void operator()(void* block) const { g_ReusePoolMgr.Free(block); }
-};
 
 // What became of a value: it may have no form in JSON, in which case it is left out.
 enum class Outcome { Made, None, Failed };
@@ -127,8 +124,7 @@ bool ReadObject(const cJSON* object, int depth, ScriptVal& out) {
         count++;
     }
     if (count == 0) return true;
-    std::unique_ptr<void, FreeBlock> block(
-        g_ReusePoolMgr.Alloc(count * (sizeof(Field) + sizeof(const cJSON*))));
+    PoolBlock<void> block(g_ReusePoolMgr.Alloc(count * (sizeof(Field) + sizeof(const cJSON*))));
     if (!block) return false;
     auto* fields = static_cast<Field*>(block.get());
     auto* items = reinterpret_cast<const cJSON**>(fields + count);

@@ -9,7 +9,7 @@
 #include <memory>
 #include <string>
 
-#include "Platform/Files.h"
+#include "Platform/FilesInternal.h"
 #include "core/ScriptText.h"
 #include "core/ScriptTextInternal.h"
 #include "core/ScriptValInternal.h"
@@ -264,22 +264,17 @@ bool Guarded(ScriptVal& out, Message& message, Make make) {
     return false;
 }
 
-struct Close {
-    void operator()(FILE* file) const { fclose(file); }
-};
-
-// The text of a file, in a pool block; null when it cannot be read.
-char* ReadFile(FILE* file) {
-    int64_t size = fseeko(file, 0, SEEK_END) == 0 ? ftello(file) : -1;
-    if (size < 0 || size == INT64_MAX) return nullptr;
+// The text of a file; null when it cannot be read.
+PoolBlock<char> ReadFile(FILE* file) {
+    int64_t size = Platform::SizeOf(file);
+    if (size < 0 || size == INT64_MAX) return {};
     rewind(file);
-    auto* text = static_cast<char*>(g_ReusePoolMgr.Alloc(static_cast<unsigned long>(size) + 1));
-    if (!text) return nullptr;
-    size_t length = fread(text, 1, static_cast<size_t>(size), file);
-    text[length] = '\0';
-    if (!ferror(file)) return text;
-    g_ReusePoolMgr.Free(text);
-    return nullptr;
+    PoolBlock<char> text(
+        static_cast<char*>(g_ReusePoolMgr.Alloc(static_cast<unsigned long>(size) + 1)));
+    if (!text) return {};
+    size_t length = fread(text.get(), 1, static_cast<size_t>(size), file);
+    text.get()[length] = '\0';
+    return ferror(file) ? PoolBlock<char>() : std::move(text);
 }
 
 }  // namespace
@@ -355,14 +350,12 @@ bool ScriptVal::FromTextByName(const char* text, const char* name, char* err, in
 }
 
 bool ScriptVal::Load(const char* file, char* err, int errlen, unsigned int) {
-    std::unique_ptr<FILE, Close> stream(Platform::fopen(file, "rb"));
+    Platform::File stream(Platform::fopen(file, "rb"));
     if (!stream) return false;
-    char* text = ReadFile(stream.get());
+    PoolBlock<char> text = ReadFile(stream.get());
     stream.reset();
     if (!text) return false;
-    bool isRead = _ScriptVal_FromText(*this, text, GetSerializePrologue(), err, errlen, false, 0);
-    g_ReusePoolMgr.Free(text);
-    return isRead;
+    return _ScriptVal_FromText(*this, text.get(), GetSerializePrologue(), err, errlen, false, 0);
 }
 
 }  // namespace Korvel

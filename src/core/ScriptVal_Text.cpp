@@ -8,7 +8,7 @@
 #include <memory>
 #include <string_view>
 
-#include "Platform/Files.h"
+#include "Platform/FilesInternal.h"
 #include "Platform/NoKillInternal.h"
 #include "core/NumbersInternal.h"
 #include "core/ScriptTextInternal.h"
@@ -139,10 +139,6 @@ public:
     }
 
     char* m_At;
-};
-
-struct FreeBlock {
-    void operator()(void* block) const { g_ReusePoolMgr.Free(block); }
 };
 
 template <class Sink>
@@ -427,14 +423,14 @@ bool ScriptVal::Save(const char* file, unsigned int options) const {
     int length = ToTextLen(0, options);
     if (length < 0) return false;
     auto size = static_cast<unsigned long>(length);
-    std::unique_ptr<void, FreeBlock> buffer(g_ReusePoolMgr.Alloc(size + 1));
+    PoolBlock<char> buffer(static_cast<char*>(g_ReusePoolMgr.Alloc(size + 1)));
     if (!buffer) return false;
-    ToText(static_cast<char*>(buffer.get()), 0, options);
-    FILE* stream = Platform::fopen(file, "wc");
+    ToText(buffer.get(), 0, options);
+    Platform::File stream(Platform::fopen(file, "wc"));
     if (!stream) return false;
-    bool isWritten = fwrite(buffer.get(), size, 1, stream) == 1 && fflush(stream) == 0;
+    bool isWritten = fwrite(buffer.get(), size, 1, stream.get()) == 1 && fflush(stream.get()) == 0;
     // Only the end of the stream tells whether its last bytes found room.
-    return fclose(stream) == 0 && isWritten;
+    return fclose(stream.release()) == 0 && isWritten;
 }
 
 }  // namespace Korvel

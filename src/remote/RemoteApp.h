@@ -202,7 +202,7 @@ public:
     void Cleanup(uint16_t run);
 
     // The calling thread begins or ends a wait for the UI thread.
-    static void SetWaitingForUI(bool isWaiting);
+    static void NoteWaitForUI(bool isWaiting);
 
     // The object with a number as FindLocalObject finds it, with one IncRef for the caller. Unlike
     // the fields of a record it stays what it is. Null also when number 1 has no object.

@@ -7,7 +7,7 @@
 #include <cstdio>
 #include <cstring>
 
-#include "Platform/Networking.h"
+#include "Platform/NetworkingInternal.h"
 #include "remote/RemoteApp.h"
 #include "remote/TrafficInternal.h"
 
@@ -17,10 +17,6 @@ namespace {
 constexpr int kHostNameSize = 256;
 
 const unsigned int kLoopback = std::bit_cast<unsigned int>(std::array<uint8_t, 4>{127, 0, 0, 1});
-
-bool IsLoopback(unsigned int ip) {
-    return std::bit_cast<std::array<uint8_t, 4>>(ip)[0] == 127;
-}
 
 }  // namespace
 
@@ -60,7 +56,7 @@ bool RemoteApp::IsPeerLocal() const {
     Platform::_SocketAddress* own = Platform::GetSocketAddress(socket);
     unsigned int ownIP = Platform::SocketAddressGetIP(own);
     Platform::DeleteSocketAddress(own);
-    return ip && (IsLoopback(ip) || ip == ownIP);
+    return ip && (Platform::IsLoopback(ip) || ip == ownIP);
 }
 
 bool RemoteApp::IsLocalIP(unsigned int ip) {

@@ -281,7 +281,7 @@ void RemoteApp::EndThread() {
 
 // What a member of this connection's thread waits for is the UI thread, which therefore must not
 // wait for what only this thread can bring.
-void RemoteApp::SetWaitingForUI(bool isWaiting) {
+void RemoteApp::NoteWaitForUI(bool isWaiting) {
     RemoteApp* app = t_Connection;
     if (!app) return;
     app->m_Traffic->m_IsWaitingForUI = isWaiting;
@@ -435,6 +435,6 @@ unsigned long long RemoteApp::TellEnd(void* appPointer, void* run) {
 }
 
 [[maybe_unused]] static const bool s_IsHooked =
-    (g_ScriptHooks.m_SetWaitingForUI = RemoteApp::SetWaitingForUI, true);
+    (g_ScriptHooks.m_SetWaitingForUI = RemoteApp::NoteWaitForUI, true);
 
 }  // namespace Korvel

@@ -1,12 +1,11 @@
 // Answers to datagrams. Whoever asks may be anybody, and what hosts tell of themselves may be
 // anything.
 #include <algorithm>
-#include <bit>
 #include <cstring>
 #include <utility>
 #include <vector>
 
-#include "Platform/Networking.h"
+#include "Platform/NetworkingInternal.h"
 #include "Platform/Processes.h"
 #include "remote/ServerDiscoveryInternal.h"
 
@@ -133,8 +132,7 @@ std::string AnswerDatagram(const HostRegistry& registry, std::string_view datagr
 }
 
 bool AnswerLimiter::Allow(unsigned int ip, int64_t nowMs) {
-    constexpr uint8_t kLoopbackNet = 127;
-    if (std::bit_cast<std::array<uint8_t, 4>>(ip)[0] == kLoopbackNet) return true;
+    if (Platform::IsLoopback(ip)) return true;
     if (m_Answers.size() >= kMostAddresses && !m_Answers.contains(ip)) {
         std::erase_if(m_Answers, [=](const auto& known) {
             return nowMs - known.second.m_LastMs >= kWindowMs;

@@ -4,9 +4,7 @@
 
 #include "core/ScriptValInternal.h"
 #include "objects/ScriptConfig.h"
-#include "objects/ScriptSymbol.h"
 #include "remote/RemoteApp.h"
-#include "remote/RemoteObject.h"
 #include "remote/ScriptApp.h"
 #include "remote/ScriptPort.h"
 #include "runtime/lua/KRScriptLibInternal.h"
@@ -116,12 +114,6 @@ int createuuid(lua_State* L) {
     return PushResult(L, [] { return ScriptVal::CreateUUID(); });
 }
 
-void Notify(const ScriptVal& target, ScriptArgs& args) {
-    if (RemoteObject* proxy = target.ToRemoteObject()) {
-        proxy->DoCommandAsync(SST_CallMemberFunction, args, nullptr, nullptr);
-    }
-}
-
 // sendnotify(target, name, object, ...) calls a member of a proxy, or of each proxy that a table
 // has, and does not wait for an answer.
 int sendnotify(lua_State* L) {
@@ -142,10 +134,7 @@ int sendnotify(lua_State* L) {
                 FromLua(inner, i + 2, entry->m_Value, nullptr, nullptr, 0);
             }
         });
-        if (status == 0) {
-            Notify(target, args);
-            for (TableEntry* entry = nullptr; target.NextKey(entry);) Notify(entry->m_Value, args);
-        }
+        if (status == 0) SendNotify(target, args);
     }
     return status == 0 ? 0 : lua_error(L);
 }
